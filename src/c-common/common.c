@@ -1,0 +1,329 @@
+/* common.c - log facility, caller identity checks and the cache daemon query client */
+#define _GNU_SOURCE
+#include "common.h"
+
+#include "paths.h"
+
+#include <arpa/inet.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <stdarg.h>
+#include <stdint.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+#include <syslog.h>
+#include <time.h>
+#include <unistd.h>
+
+#define SOURCE_PATH "src/c-common/common"
+#define PROCESS_NAME_SIZE 64
+#define TIMESTAMP_SIZE 256
+#define BODY_SIZE 8192
+#define LINE_SIZE 32767
+#define CMDLINE_READ_SIZE 256
+#define PID_TEXT_SIZE 64
+#define QUERY_TIMEOUT_SECONDS 5
+#define PATH_MAX_TEXT 4096
+
+static int env_is_set(const char *name)
+{
+    const char *value = getenv(name);
+    return value != NULL && value[0] != '\0';
+}
+
+void log_message(int level, const char *file, int line, const char *function, const char *format, ...)
+{
+    if (level >= 8 && !env_is_set("KEST_IAM_LOGLEVEL"))
+        return;
+    if (file == NULL || function == NULL || format == NULL)
+        return;
+
+    char timestamp[TIMESTAMP_SIZE];
+    char process[PROCESS_NAME_SIZE];
+    char body[BODY_SIZE];
+    char text[LINE_SIZE];
+    memset(timestamp, 0, sizeof(timestamp));
+    memset(process, 0, sizeof(process));
+    memset(body, 0, sizeof(body));
+    memset(text, 0, sizeof(text));
+
+    unsigned int pid = (unsigned int)getpid();
+    time_t now = time(NULL);
+    struct tm local;
+    if (localtime_r(&now, &local) != NULL)
+        strftime(timestamp, TIMESTAMP_SIZE - 1, "%Y-%m-%d %H:%M:%S", &local);
+
+    get_process_name(process);
+    if (process[0] == '\0')
+        return;
+
+    const char *user = getenv("USER");
+    unsigned int uid = getuid(), euid = geteuid(), gid = getgid(), egid = getegid();
+
+    va_list args;
+    va_start(args, format);
+    vsnprintf(body, BODY_SIZE - 2, format, args);
+    va_end(args);
+
+    /* The finished text is handed on through "%s" so that a "%" in the body is never interpreted. */
+    if (user != NULL)
+        snprintf(text, LINE_SIZE - 2, "%s process: %s(%u), user: %s(%u,%u, %u,%u), %s, %u, %s, %s ", timestamp,
+                 process, pid, user, uid, euid, gid, egid, file, (unsigned int)line, function, body);
+    else
+        snprintf(text, LINE_SIZE - 2, "%s process: %s(%u), user: %u,%u, %u,%u, %s, %u, %s, %s  ", timestamp, process,
+                 pid, uid, euid, gid, egid, file, (unsigned int)line, function, body);
+
+    syslog(level, "%s", text);
+    if (level <= 4)
+        fprintf(stderr, "%s\n", text);
+    else if (level >= 8)
+        fprintf(stdout, "%s\n", text);
+}
+
+int get_process_name(char *out)
+{
+    FILE *file = fopen("/proc/self/cmdline", "re");
+    if (file == NULL)
+        return 0;
+    char argument[CMDLINE_READ_SIZE];
+    memset(argument, 0, sizeof(argument));
+    char *read = fgets(argument, CMDLINE_READ_SIZE, file);
+    fclose(file);
+    if (read == NULL || argument[0] == '\0')
+        return 0;
+
+    const char *slash = strrchr(argument, '/');
+    const char *name = slash ? slash + 1 : argument;
+    /* One byte short of the 64-byte buffer so the result always stays terminated. */
+    size_t length = strnlen(name, PROCESS_NAME_SIZE - 1);
+    memcpy(out, name, length);
+    out[length] = '\0';
+    if (length > 0 && out[length - 1] == '\n')
+        out[length - 1] = '\0';
+    return 1;
+}
+
+static int process_name_in(const char *const *names, size_t count, int unreadable)
+{
+    char process[CMDLINE_READ_SIZE];
+    memset(process, 0, sizeof(process));
+    if (!get_process_name(process) || process[0] == '\0')
+        return unreadable;
+    for (size_t i = 0; i < count; ++i) {
+        if (strcmp(process, names[i]) == 0)
+            return 1;
+    }
+    return 0;
+}
+
+#define COUNT_OF(array) (sizeof(array) / sizeof((array)[0]))
+
+int is_trusted_caller(void)
+{
+    static const char *const names[] = { "systemd-logind", "systemd-coredump", "systemd-journald",
+                                         "accounts-daemon", "sudo", "cache-kest" };
+    return process_name_in(names, COUNT_OF(names), 1);
+}
+
+int is_printer_caller(void)
+{
+    static const char *const names[] = { "lpadmin", "ose-printer" };
+    return process_name_in(names, COUNT_OF(names), 1);
+}
+
+int is_accounts_daemon(void)
+{
+    static const char *const names[] = { "accounts-daemon" };
+    return process_name_in(names, COUNT_OF(names), 0);
+}
+
+int is_special_group(const char *group)
+{
+    static const char *const groups[] = { "users", "kest", "sudo", "lp", "lpadmin", "scanner", "dialout" };
+    if (group == NULL)
+        return 1;
+    for (size_t i = 0; i < COUNT_OF(groups); ++i) {
+        if (strcmp(group, groups[i]) == 0)
+            return 0;
+    }
+    return 1;
+}
+
+static int cache_pid_path(char *out, size_t size)
+{
+    return kest_path(KEST_PATH_CACHE_PID, out, size);
+}
+
+int pid_file_exists(void)
+{
+    char path[PATH_MAX_TEXT];
+    struct stat info;
+    if (!cache_pid_path(path, sizeof(path)) || lstat(path, &info) != 0)
+        return 0;
+    return info.st_size > 0 ? 1 : 0;
+}
+
+int read_pid_file(char *out)
+{
+    if (!pid_file_exists())
+        return 0;
+    char path[PATH_MAX_TEXT];
+    if (!cache_pid_path(path, sizeof(path)))
+        return 0;
+    FILE *file = fopen(path, "re");
+    if (file == NULL)
+        return 0;
+    memset(out, 0, PID_TEXT_SIZE);
+    char *read = fgets(out, PID_TEXT_SIZE - 1, file);
+    fclose(file);
+    if (read == NULL || out[0] == '\0')
+        return 0;
+    size_t length = strlen(out);
+    while (length > 0 && (out[length - 1] == '\n' || out[length - 1] == '\r'))
+        out[--length] = '\0';
+    return length > 0 ? 1 : 0;
+}
+
+int is_cache_daemon_running(void)
+{
+    static const char daemon_name[] = "cache-kest";
+    const size_t name_length = sizeof(daemon_name) - 1;
+    char pid[PID_TEXT_SIZE];
+    memset(pid, 0, sizeof(pid));
+    /* Without a pid "/proc//cmdline" would name the kernel's command line. */
+    if (!read_pid_file(pid))
+        return 0;
+
+    char buffer[CMDLINE_READ_SIZE];
+    memset(buffer, 0, sizeof(buffer));
+    snprintf(buffer, sizeof(buffer), "/proc/%s/cmdline", pid);
+    struct stat info;
+    if (lstat(buffer, &info) != 0)
+        return 0;
+    int fd = open(buffer, O_RDONLY | O_CLOEXEC);
+    if (fd < 0)
+        return 0;
+    memset(buffer, 0, sizeof(buffer));
+    ssize_t got = read(fd, buffer, sizeof(buffer) - 1);
+    close(fd);
+    if (got <= 0)
+        return 0;
+
+    size_t length = strlen(buffer);
+    return length > name_length - 1 && strcmp(buffer + length - name_length, daemon_name) == 0 ? 1 : 0;
+}
+
+int is_connect(int socket)
+{
+    int error = 0;
+    socklen_t length = sizeof(error);
+    int result = getsockopt(socket, SOL_SOCKET, SO_ERROR, &error, &length);
+    if (result != 0) {
+        log_message(3, SOURCE_PATH, 269, "is_connect", "getsockopt error code: %d", result);
+        return 0;
+    }
+    if (error != 0) {
+        log_message(3, SOURCE_PATH, 273, "is_connect", "socket error code: %d, detail: %s", error, strerror(error));
+        return 0;
+    }
+    return 1;
+}
+
+static int set_timeout(int socket, int option)
+{
+    struct timeval timeout = { QUERY_TIMEOUT_SECONDS, 0 };
+    return setsockopt(socket, SOL_SOCKET, option, &timeout, sizeof(timeout));
+}
+
+static int fail_query(int socket, int line, const char *format)
+{
+    int code = errno;
+    log_message(3, SOURCE_PATH, line, "socket_query", format, code, strerror(code));
+    if (socket >= 0)
+        close(socket);
+    return 0;
+}
+
+int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
+{
+    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return fail_query(-1, 288, "socket init failed, code: %d, detail: %s");
+
+    struct sockaddr_in address;
+    memset(&address, 0, sizeof(address));
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    unsigned short port = 0;
+    if (!pid_file_exists() || !read_port(&port))
+        return fail_query(fd, 297, "read port failed, code: %d, detail: %s");
+    address.sin_port = htons(port);
+
+    if (connect(fd, (struct sockaddr *)&address, sizeof(address)) != 0)
+        return fail_query(fd, 303, "connect socket failed, code: %d, detail: %s");
+    if (!is_connect(fd)) {
+        close(fd);
+        return 0;
+    }
+
+    set_timeout(fd, SO_SNDTIMEO);
+    if (send(fd, request, request_length, MSG_NOSIGNAL) < 0)
+        return fail_query(fd, 313, "send message failed, code: %d, detail: %s");
+
+    set_timeout(fd, SO_RCVTIMEO);
+    ssize_t received = recv(fd, reply, reply_capacity, 0);
+    if (received < 0)
+        return fail_query(fd, 319, "receive message failed, code: %d, detail: %s");
+    if (received < 4) {
+        /* A peer that closes before a whole length prefix arrived sent no reply. */
+        errno = received == 0 ? ECONNRESET : EPROTO;
+        return fail_query(fd, 319, "receive message failed, code: %d, detail: %s");
+    }
+
+    uint32_t prefix;
+    memcpy(&prefix, reply, sizeof(prefix));
+    size_t length = ntohl(prefix);
+    size_t available = (size_t)received - 4;
+    /* Only bytes this single receive produced are moved; the rest of the buffer is zeroed. */
+    size_t body = length < available ? length : available;
+    memmove(reply, reply + 4, body);
+    memset(reply + body, 0, reply_capacity - body);
+    close(fd);
+    return 1;
+}
+
+int read_port(unsigned short *port)
+{
+    char path[PATH_MAX_TEXT];
+    if (port == NULL || !cache_pid_path(path, sizeof(path)))
+        return 0;
+    FILE *file = fopen(path, "re");
+    if (file == NULL)
+        return 0;
+
+    char line[PID_TEXT_SIZE];
+    char kept[PID_TEXT_SIZE];
+    memset(kept, 0, sizeof(kept));
+    while (fgets(line, PID_TEXT_SIZE, file) != NULL) {
+        if (strlen(line) >= 2)
+            memcpy(kept, line, sizeof(kept));
+    }
+    fclose(file);
+
+    size_t length = strlen(kept);
+    while (length > 0 && (kept[length - 1] == '\n' || kept[length - 1] == '\r'))
+        kept[--length] = '\0';
+    if (length == 0)
+        return 0;
+    for (size_t i = 0; i < length; ++i) {
+        if (kept[i] < '0' || kept[i] > '9')
+            return 0;
+    }
+    *port = (unsigned short)strtoul(kept, NULL, 10);
+    return 1;
+}

@@ -1,0 +1,12 @@
+#pragma once
+
+#include <QtGlobal>
+
+class QMessageLogContext;
+class QString;
+
+// Routes every Qt message to the system log, prefixed with the process's processor time.
+void messageHandler(QtMsgType type, const QMessageLogContext &context, const QString &message);
+
+// Syslog priority of a Qt message type (critical and fatal cross on purpose).
+int syslogPriorityOf(QtMsgType type);
