@@ -2,7 +2,8 @@
 
 #include "paths.h"
 
-namespace {
+namespace
+{
 QString prefixed(const char *path)
 {
     return QString::fromLocal8Bit(kest_root()) + QString::fromLatin1(path);
@@ -22,6 +23,16 @@ QString KestPaths::settingsFile()
 QString KestPaths::workDir()
 {
     return prefixed(KEST_PATH_WORKDIR);
+}
+
+QString KestPaths::groupsFile()
+{
+    return workDir() + QStringLiteral("/groups.txt");
+}
+
+QString KestPaths::specialsFile()
+{
+    return workDir() + QStringLiteral("/specials.txt");
 }
 
 QString KestPaths::dbusPidFile()

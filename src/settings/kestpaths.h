@@ -9,6 +9,8 @@ public:
     static QString root();
     static QString settingsFile();
     static QString workDir();
+    static QString groupsFile();
+    static QString specialsFile();
     static QString dbusPidFile();
     static QString cachePidFile();
     static QString homeRoot();
