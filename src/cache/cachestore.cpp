@@ -1,1 +1,199 @@
+#include "cachestore.h"
 
+#include "kestpaths.h"
+
+#include <QDebug>
+#include <QDir>
+#include <QFile>
+#include <QFileInfo>
+#include <QRegularExpression>
+
+#include <cerrno>
+#include <unistd.h>
+
+namespace
+{
+constexpr int kFirstDomainUid = 10000;
+
+QString workDir()
+{
+    return KestPaths::workDir();
+}
+
+bool workDirExists()
+{
+    return QFileInfo(workDir()).isDir();
+}
+
+QFileInfoList regularFiles()
+{
+    return QDir(workDir()).entryInfoList(QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot, QDir::Unsorted);
+}
+
+bool isDomainUserFileName(const QString &name)
+{
+    bool isNumber = false;
+    const int uid = name.toInt(&isNumber, 10);
+    return isNumber && uid >= kFirstDomainUid;
+}
+
+void cleanDomainUserFile(const QString &path)
+{
+    if (::chown(QFile::encodeName(path).constData(), 0, 0) != 0) {
+        const int error = errno;
+        qWarning().noquote() << QStringLiteral("cannot change file owner, ") + path + QStringLiteral(", error:")
+                + qt_error_string(error);
+    }
+    if (!QFile::remove(path))
+        qWarning().noquote() << QStringLiteral("cannot remove domain user cache file, ") + path;
+}
+} // namespace
+
+QString cacheFilePath(const CacheControlInterface &record)
+{
+    return cacheFilePathOfUid(record.uid());
+}
+
+QString cacheFilePathOfUid(quint32 uid)
+{
+    return workDir() + QLatin1Char('/') + QString::number(uid);
+}
+
+bool cacheFileExists(const CacheControlInterface &record)
+{
+    return QFile::exists(cacheFilePath(record));
+}
+
+bool saveCacheRecord(CacheControlInterface &record)
+{
+    return record.writeToFile(cacheFilePath(record));
+}
+
+bool loadCacheRecord(CacheControlPtr &record)
+{
+    if (!record)
+        return false;
+    const QString path = cacheFilePath(*record);
+    const quint32 fileVersion = cacheVersionOfFile(path);
+    if (fileVersion != record->version()) {
+        const quint32 uid = record->uid();
+        record = createCacheControl(fileVersion);
+        if (!record)
+            return false;
+        record->setUid(uid);
+    }
+    return record->readFromFile(path);
+}
+
+bool cacheRecordFromJson(CacheControlPtr &record, const QString &json)
+{
+    const quint32 jsonVersion = cacheVersionOfJson(json);
+    if (!record || jsonVersion != record->version()) {
+        record = createCacheControl(jsonVersion);
+        if (!record) {
+            qWarning().noquote() << QStringLiteral("invalid cache control version.");
+            return false;
+        }
+    }
+    return record->fromJsonString(json);
+}
+
+quint32 uidOfCacheFilePath(const QString &path)
+{
+    bool isNumber = false;
+    const quint32 uid = path.mid(path.lastIndexOf(QLatin1Char('/')) + 1).toUInt(&isNumber, 10);
+    return isNumber ? uid : 0;
+}
+
+QStringList listCacheFiles()
+{
+    QStringList paths;
+    if (!workDirExists())
+        return paths;
+    static const QRegularExpression recordName(QStringLiteral("/\\d+$"));
+    const QFileInfoList entries = regularFiles();
+    for (const QFileInfo &entry : entries) {
+        const QString path = entry.absoluteFilePath();
+        if (recordName.match(path).hasMatch())
+            paths.append(path);
+    }
+    return paths;
+}
+
+QList<quint32> listCacheUids()
+{
+    QList<quint32> uids;
+    const QString prefix = workDir() + QLatin1Char('/');
+    const QStringList paths = listCacheFiles();
+    for (const QString &path : paths) {
+        bool isNumber = false;
+        const quint32 uid = path.startsWith(prefix) ? path.mid(prefix.size()).toUInt(&isNumber, 10) : 0;
+        if (!isNumber) {
+            qWarning().noquote() << QStringLiteral("cache file path error !!!");
+            continue;
+        }
+        uids.append(uid);
+    }
+    return uids;
+}
+
+bool findCacheUidByAccount(const QString &account, quint32 &uid)
+{
+    uid = 0;
+    const QStringList paths = listCacheFiles();
+    for (const QString &path : paths) {
+        const quint32 candidate = uidOfCacheFilePath(path);
+        if (!path.endsWith(QString::number(candidate)))
+            continue;
+        CacheControlPtr record = createCacheControl();
+        record->setUid(candidate);
+        loadCacheRecord(record);
+        if (record && record->account() == account) {
+            uid = candidate;
+            return true;
+        }
+    }
+    return false;
+}
+
+void removeCacheFile(quint32 uid)
+{
+    const QString path = cacheFilePathOfUid(uid);
+    if (QFile::exists(path))
+        QFile::remove(path);
+}
+
+void removeAllCacheFiles()
+{
+    const QStringList paths = listCacheFiles();
+    for (const QString &path : paths) {
+        if (QFile::exists(path))
+            removeCacheFile(uidOfCacheFilePath(path));
+    }
+}
+
+void cleanDomainUserCacheFiles()
+{
+    if (!workDirExists()) {
+        qWarning().noquote() << QStringLiteral("service working directory is not exists.");
+        return;
+    }
+    const QFileInfoList entries = regularFiles();
+    for (const QFileInfo &entry : entries) {
+        const QString path = entry.absoluteFilePath();
+        if (!isDomainUserFileName(entry.fileName())) {
+            qInfo().noquote() << QStringLiteral("not domain user cache file: ") + path;
+            continue;
+        }
+        cleanDomainUserFile(path);
+    }
+}
+
+bool refreshCacheRecord(quint32 uid)
+{
+    CacheControlPtr record = createCacheControl();
+    record->setUid(uid);
+    if (!loadCacheRecord(record))
+        return false;
+    return saveCacheRecord(*record);
+}

@@ -1,1 +1,54 @@
+#include "offlinelogin.h"
 
+#include "cachestore.h"
+#include "kestpaths.h"
+
+#include <QDebug>
+#include <QSettings>
+
+namespace
+{
+bool offlineLoginEnabled()
+{
+    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
+    settings.beginGroup(QStringLiteral("offline_login"));
+    const bool enabled = settings.value(QStringLiteral("enable"), false).toBool();
+    settings.endGroup();
+    return enabled;
+}
+
+// A record that cannot be read counts as an empty one: never marked, never effective.
+CacheControlPtr loadedRecord(quint32 uid)
+{
+    CacheControlPtr record = createCacheControl();
+    record->setUid(uid);
+    loadCacheRecord(record);
+    return record ? record : createCacheControl();
+}
+} // namespace
+
+// The order of the tests decides which single warning a refusal leaves.
+bool checkOfflineLogin(const QString &account)
+{
+    quint32 uid = 0;
+    if (!findCacheUidByAccount(account, uid)) {
+        qWarning().noquote() << QStringLiteral("[checkOfflineLogin]: Cache file not found");
+        return false;
+    }
+    const CacheControlPtr record = loadedRecord(uid);
+    const bool enabled = offlineLoginEnabled();
+    if (record->removeStatus() != 0) {
+        qWarning().noquote() << QStringLiteral("[removeStatus]: The cache file is marked for deletion: ")
+                + QString::number(record->removeStatus());
+        return false;
+    }
+    if (!record->isCacheEffective()) {
+        qWarning().noquote() << QStringLiteral("[checkCacheEffectiveSeconds]: false");
+        return false;
+    }
+    if (!enabled) {
+        qWarning().noquote() << QStringLiteral("[offline_login_enable]: false");
+        return false;
+    }
+    return true;
+}
