@@ -1,0 +1,374 @@
+#include "kestcachelocalserver.h"
+
+#include "cachestore.h"
+#include "kestcacheservice.h"
+#include "kestpaths.h"
+
+#include <QDebug>
+#include <QFile>
+#include <QJsonArray>
+#include <QJsonDocument>
+#include <QPointer>
+#include <QSettings>
+#include <QTcpSocket>
+#include <QTimer>
+#include <QtEndian>
+
+namespace
+{
+const int errorReplyVersion = 16777216;
+const char partialTimerProperty[] = "kestPartialFrameTimer";
+
+struct FunctionSpec {
+    const char *name;
+    int argumentCount;
+};
+const FunctionSpec functions[] = {
+    { "queryAccountName", 1 },
+    { "queryUid", 1 },
+    { "queryGroupName", 2 },
+    { "queryGid", 2 },
+    { "authenticatePassword", 2 },
+    { "modifyUser", 1 },
+};
+
+struct PolicyKey {
+    const char *key;
+    QJsonValue::Type type;
+};
+struct PolicyGroup {
+    const char *group;
+    QList<PolicyKey> keys;
+};
+
+const QList<PolicyGroup> &passwordPolicy()
+{
+    static const QList<PolicyGroup> groups {
+        { "pw_strength",
+            { { "character_enable", QJsonValue::Bool }, { "characters", QJsonValue::String },
+                { "contains_user", QJsonValue::Bool }, { "lower", QJsonValue::Bool },
+                { "max_length", QJsonValue::Double }, { "min_length", QJsonValue::Double },
+                { "number", QJsonValue::Bool }, { "required", QJsonValue::Double },
+                { "special_enable", QJsonValue::Bool }, { "special_string", QJsonValue::String },
+                { "strength", QJsonValue::Bool }, { "upper", QJsonValue::Bool } } },
+        { "pw_validity",
+            { { "enable", QJsonValue::Bool }, { "effective_time", QJsonValue::Double },
+                { "tip_time", QJsonValue::Double } } },
+        { "pw_history_check", { { "enable", QJsonValue::Bool }, { "history_num", QJsonValue::Double } } },
+        { "first_login", { { "enable", QJsonValue::Bool }, { "update_password", QJsonValue::Bool } } },
+        { "offline_login", { { "enable", QJsonValue::Bool }, { "cache_validity", QJsonValue::Double } } },
+    };
+    return groups;
+}
+
+QVariant settingOf(const QJsonValue &value, QJsonValue::Type type)
+{
+    switch (type) {
+    case QJsonValue::Bool:
+        return value.toVariant().toBool();
+    case QJsonValue::String:
+        return value.toVariant().toString();
+    default:
+        return value.toVariant().toInt();
+    }
+}
+
+QString compact(const QJsonObject &object)
+{
+    return QString::fromUtf8(QJsonDocument(object).toJson(QJsonDocument::Compact));
+}
+} // namespace
+
+KestCacheLocalServer::KestCacheLocalServer(KestCacheService *service, QObject *parent)
+    : QTcpServer(parent)
+    , m_service(service)
+{
+    connect(this, &QTcpServer::newConnection, this, &KestCacheLocalServer::onNewConnection);
+    connect(this, &QTcpServer::acceptError, this, &KestCacheLocalServer::onAcceptError);
+}
+
+KestCacheLocalServer::~KestCacheLocalServer() = default;
+
+QByteArray KestCacheLocalServer::frame(const QByteArray &payload)
+{
+    QByteArray framed(4, '\0');
+    qToBigEndian<quint32>(quint32(payload.size()), framed.data());
+    return framed + payload;
+}
+
+void KestCacheLocalServer::onNewConnection()
+{
+    while (QTcpSocket *socket = nextPendingConnection()) {
+        connect(socket, &QTcpSocket::readyRead, this, &KestCacheLocalServer::onReadyRead);
+        connect(socket, &QTcpSocket::disconnected, this, &KestCacheLocalServer::onDisconnected);
+    }
+}
+
+void KestCacheLocalServer::onAcceptError(QAbstractSocket::SocketError error)
+{
+    qWarning().noquote() << QStringLiteral("onAcceptError : ") + QString::number(int(error));
+}
+
+void KestCacheLocalServer::onDisconnected()
+{
+    if (auto *socket = qobject_cast<QTcpSocket *>(sender()))
+        socket->deleteLater();
+}
+
+void KestCacheLocalServer::onReadyRead()
+{
+    auto *socket = qobject_cast<QTcpSocket *>(sender());
+    if (!socket)
+        return;
+    // Strictly more than the length prefix: an empty frame waits for further bytes.
+    if (socket->bytesAvailable() <= 4) {
+        watchPartialFrame(socket);
+        return;
+    }
+    const QByteArray prefix = socket->peek(4);
+    const quint32 length = qFromBigEndian<quint32>(prefix.constData());
+    if (length > maximumFrameLength) {
+        sendErrorReply(socket, QStringLiteral("Frame too large !!!"));
+        socket->disconnectFromHost();
+        return;
+    }
+    if (quint64(length) + 4 > quint64(socket->bytesAvailable())) {
+        watchPartialFrame(socket);
+        return;
+    }
+    socket->read(4);
+    const QByteArray payload = socket->read(length);
+    handleRequest(socket, payload);
+    watchPartialFrame(socket);
+}
+
+void KestCacheLocalServer::watchPartialFrame(QTcpSocket *socket)
+{
+    auto *timer = socket->property(partialTimerProperty).value<QTimer *>();
+    if (socket->bytesAvailable() == 0) {
+        if (timer)
+            timer->stop();
+        return;
+    }
+    if (!timer) {
+        timer = new QTimer(socket);
+        timer->setSingleShot(true);
+        timer->setInterval(partialFrameTimeoutMs);
+        connect(timer, &QTimer::timeout, socket, [socket]() {
+            if (socket->bytesAvailable() > 0)
+                socket->abort();
+        });
+        socket->setProperty(partialTimerProperty, QVariant::fromValue(timer));
+    }
+    if (!timer->isActive())
+        timer->start();
+}
+
+void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &payload)
+{
+    QJsonParseError error;
+    const QJsonDocument document = QJsonDocument::fromJson(payload, &error);
+    if (error.error != QJsonParseError::NoError || !document.isObject()) {
+        qWarning().noquote() << QStringLiteral("Error in JSON data !!!");
+        sendErrorReply(socket, QStringLiteral("Error in JSON data !!!"));
+        return;
+    }
+    const QJsonObject request = document.object();
+    if (request.contains(QLatin1String("command")))
+        handleServerCommand(socket, request);
+    else
+        dispatchFunctionCall(socket, request);
+}
+
+void KestCacheLocalServer::sendErrorReply(QTcpSocket *socket, const QString &text)
+{
+    const QJsonObject reply { { QStringLiteral("version"), errorReplyVersion }, { QStringLiteral("errorInfo"), text } };
+    socket->write(frame(QJsonDocument(reply).toJson(QJsonDocument::Compact)));
+}
+
+QString KestCacheLocalServer::sendResultReply(QTcpSocket *socket, int retVal, const QString &text)
+{
+    const QString reply = compact({ { QStringLiteral("retVal"), retVal }, { QStringLiteral("errorMessage"), text } });
+    socket->write(frame(reply.toUtf8()));
+    return reply;
+}
+
+QString KestCacheLocalServer::sendStatusReply(QTcpSocket *socket, int code, const QString &text)
+{
+    const QString reply = compact({ { QStringLiteral("code"), code }, { QStringLiteral("msg"), text },
+        { QStringLiteral("data"), QJsonValue::Null } });
+    socket->write(frame(reply.toUtf8()));
+    return reply;
+}
+
+QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJsonObject &request)
+{
+    if (!request.contains(QLatin1String("functionName")) || !request.contains(QLatin1String("argv"))
+        || !request.contains(QLatin1String("version"))) {
+        sendErrorReply(
+            socket, QStringLiteral("The JSON field is missing. version, functionName and argv are required !!!"));
+        return QString();
+    }
+    const QString name = request.value(QLatin1String("functionName")).toString();
+    const QJsonArray argv = request.value(QLatin1String("argv")).toArray();
+    for (const FunctionSpec &function : functions) {
+        if (name != QLatin1String(function.name))
+            continue;
+        if (argv.size() != function.argumentCount) {
+            sendErrorReply(socket, QStringLiteral("Error in JSON argv array (all array members must be strings) !!!"));
+            return QString();
+        }
+        QStringList arguments;
+        for (const QJsonValue &argument : argv)
+            arguments.append(argument.toString());
+        bool known = false;
+        // The service may wait on the domain server in a nested event loop, where the peer can vanish.
+        const QPointer<QTcpSocket> guard(socket);
+        const QString result = callService(name, arguments, known);
+        if (!guard)
+            return result;
+        const QByteArray payload = QJsonDocument::fromJson(result.toUtf8()).toJson(QJsonDocument::Compact);
+        if (socket->state() != QAbstractSocket::ConnectedState) {
+            qWarning().noquote() << QStringLiteral("socket error: ") + socket->errorString();
+            return result;
+        }
+        socket->write(frame(payload));
+        return result;
+    }
+    sendErrorReply(socket, QStringLiteral("Function name not defined !!!"));
+    return QString();
+}
+
+QString KestCacheLocalServer::callService(const QString &name, const QStringList &arguments, bool &known)
+{
+    known = true;
+    if (name == QLatin1String("queryAccountName"))
+        return m_service->queryAccountName(arguments.at(0));
+    if (name == QLatin1String("queryUid"))
+        return m_service->queryUid(arguments.at(0).toUInt());
+    if (name == QLatin1String("queryGroupName"))
+        return m_service->queryGroupName(arguments.at(0), arguments.at(1));
+    if (name == QLatin1String("queryGid"))
+        return m_service->queryGid(arguments.at(0).toUInt(), arguments.at(1));
+    if (name == QLatin1String("authenticatePassword"))
+        return m_service->authenticatePassword(arguments.at(0), arguments.at(1));
+    if (name == QLatin1String("modifyUser"))
+        return m_service->modifyUser(arguments.at(0));
+    known = false;
+    return QString();
+}
+
+void KestCacheLocalServer::handleServerCommand(QTcpSocket *socket, const QJsonObject &request)
+{
+    if (!request.contains(QLatin1String("command")) || !request.contains(QLatin1String("data"))) {
+        sendResultReply(socket, 1, QStringLiteral("The JSON field is missing. command and data are required !!!"));
+        return;
+    }
+    const QJsonValue data = request.value(QLatin1String("data"));
+    switch (request.value(QLatin1String("command")).toInt()) {
+    case 1:
+        qDebug().noquote() << QStringLiteral("---------------ServerCommand::CleanCache");
+        cleanCache(socket, data);
+        return;
+    case 2:
+        qDebug().noquote() << QStringLiteral("---------------CleanCacheNotInList");
+        cleanCacheNotInList(socket, data);
+        return;
+    case 3:
+        qDebug().noquote() << QStringLiteral("---------------ServerCommand::UpdateCache");
+        updateCache(socket, data);
+        return;
+    case 4:
+        qDebug().noquote() << QStringLiteral("---------------ServerCommand::PasswordConfig");
+        passwordConfig(socket, data);
+        return;
+    case 5:
+        qDebug().noquote() << QStringLiteral("---------------ServerCommand::ModifyUserPasswd");
+        modifyUserPassword(socket, data);
+        return;
+    default:
+        sendResultReply(socket, 1, QStringLiteral("invalid command!!!"));
+    }
+}
+
+QString KestCacheLocalServer::cleanCache(QTcpSocket *socket, const QJsonValue &data)
+{
+    const QString path = cacheFilePathOfUid(data.toString().toUInt());
+    if (!QFile::exists(path))
+        return sendResultReply(socket, 1, QStringLiteral("[CleanCache] : cache file not exists!!!"));
+    QFile::remove(path);
+    return sendResultReply(socket, 0, QString());
+}
+
+QString KestCacheLocalServer::cleanCacheNotInList(QTcpSocket *socket, const QJsonValue &data)
+{
+    QJsonParseError error;
+    const QJsonDocument document = QJsonDocument::fromJson(data.toString().toUtf8(), &error);
+    if (error.error != QJsonParseError::NoError)
+        return sendResultReply(socket, 1, QStringLiteral("[CleanCacheNotInList] : json parse error!!!"));
+    const QJsonArray whitelist = document.object().value(QLatin1String("whitelist")).toArray();
+    const QList<quint32> uids = listCacheUids();
+    for (const quint32 uid : uids) {
+        // Only numbers match: an id written as a JSON string does not keep its file.
+        const bool kept = std::any_of(whitelist.begin(), whitelist.end(),
+            [uid](const QJsonValue &value) { return value.isDouble() && value.toDouble() == double(uid); });
+        const QString path = cacheFilePathOfUid(uid);
+        if (!kept && QFile::exists(path))
+            QFile::remove(path);
+    }
+    return sendResultReply(socket, 0, QString());
+}
+
+QString KestCacheLocalServer::updateCache(QTcpSocket *socket, const QJsonValue &data)
+{
+    const quint32 uid = quint32(data.toInt());
+    if (!QFile::exists(cacheFilePathOfUid(uid)))
+        return sendResultReply(socket, 1, QStringLiteral("[UpdateCache] : cache file not exists!!!"));
+    refreshCacheRecord(uid);
+    return sendResultReply(socket, 0, QString());
+}
+
+QString KestCacheLocalServer::passwordConfig(QTcpSocket *socket, const QJsonValue &data)
+{
+    QJsonParseError error;
+    const QJsonDocument document = QJsonDocument::fromJson(data.toString().toUtf8(), &error);
+    if (error.error != QJsonParseError::NoError)
+        return sendResultReply(socket, 1, QStringLiteral("[PasswordConfig] : pw-config json parse error!!!"));
+    const QJsonObject policy = document.object();
+    for (const PolicyGroup &group : passwordPolicy()) {
+        if (!policy.contains(QLatin1String(group.group)))
+            return sendResultReply(socket, 1,
+                QStringLiteral("[PasswordConfig] : pw-config json missing field,[pw_strength "
+                               "pw_validity pw_history_check first_login offline_login]"));
+    }
+    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
+    for (const PolicyGroup &group : passwordPolicy()) {
+        const QJsonObject values = policy.value(QLatin1String(group.group)).toObject();
+        settings.beginGroup(QLatin1String(group.group));
+        for (const PolicyKey &key : group.keys) {
+            if (values.contains(QLatin1String(key.key)))
+                settings.setValue(QLatin1String(key.key), settingOf(values.value(QLatin1String(key.key)), key.type));
+        }
+        settings.endGroup();
+    }
+    settings.sync();
+    return sendResultReply(socket, 0, QString());
+}
+
+QString KestCacheLocalServer::modifyUserPassword(QTcpSocket *socket, const QJsonValue &data)
+{
+    const QString text = data.toString();
+    QJsonParseError error;
+    const QJsonDocument document = QJsonDocument::fromJson(text.toUtf8(), &error);
+    if (error.error != QJsonParseError::NoError)
+        return sendStatusReply(socket, 1, QStringLiteral("json格式解析错误"));
+    const QJsonObject request = document.object();
+    if (!request.contains(QLatin1String("username")) || !request.contains(QLatin1String("password"))
+        || !request.contains(QLatin1String("old_password")))
+        return sendStatusReply(socket, 2, QStringLiteral("请求消息缺少必要的字段,username,password,old_password"));
+    const QPointer<QTcpSocket> guard(socket);
+    const QString reply = m_service->modifyUser(text);
+    if (guard)
+        socket->write(frame(reply.toUtf8()));
+    return reply;
+}

@@ -1,0 +1,275 @@
+#include "kestcacheservice.h"
+
+#include "cachestore.h"
+#include "globalsetting.h"
+#include "grouplistmanager.h"
+#include "homedirectoryrepair.h"
+#include "httphelper.h"
+#include "offlinelogin.h"
+#include "userlistmanager.h"
+
+#include <QDebug>
+#include <QJsonDocument>
+#include <QThread>
+
+#include <cerrno>
+#include <ctime>
+#include <limits>
+#include <mutex>
+#include <thread>
+
+// Shared with the detached worker so that it never signals a service that is gone.
+struct KestCacheWorkerState {
+    std::mutex mutex;
+    bool serviceAlive = true;
+};
+
+namespace
+{
+const QString shadowedPassword = QStringLiteral("x");
+const uint firstDomainUid = 10000;
+
+QString threadId()
+{
+    return QString::number(reinterpret_cast<quintptr>(QThread::currentThreadId()));
+}
+
+void sleepOneSecond()
+{
+    struct timespec remaining = { 1, 0 };
+    while (nanosleep(&remaining, &remaining) != 0 && errno == EINTR) { }
+}
+} // namespace
+
+KestCacheService::KestCacheService(QObject *parent)
+    : QObject(parent)
+    , m_http(std::make_unique<HttpHelper>())
+    , m_groups(std::make_unique<GroupListManager>())
+    , m_users(std::make_unique<UserListManager>(m_groups.get()))
+    , m_worker(std::make_shared<KestCacheWorkerState>())
+{
+    connect(this, &KestCacheService::updateCache, this, &KestCacheService::onUpdateCache, Qt::AutoConnection);
+    std::thread(waitForServer, this, m_worker).detach();
+}
+
+KestCacheService::~KestCacheService()
+{
+    std::lock_guard<std::mutex> lock(m_worker->mutex);
+    m_worker->serviceAlive = false;
+}
+
+void KestCacheService::waitForServer(KestCacheService *service, std::shared_ptr<KestCacheWorkerState> state)
+{
+    auto http = std::make_unique<HttpHelper>();
+    QString hostPort;
+    // Wait while the domain server cannot be reached, then refresh once.
+    while (!http->checkServerAddress(hostPort)) {
+        sleepOneSecond();
+        std::lock_guard<std::mutex> lock(state->mutex);
+        if (!state->serviceAlive)
+            return;
+    }
+    std::lock_guard<std::mutex> lock(state->mutex);
+    if (!state->serviceAlive)
+        return;
+    qInfo().noquote() << QStringLiteral("==================>> Q_EMIT updateCache, thread id: ") + threadId();
+    Q_EMIT service->updateCache();
+}
+
+void KestCacheService::onUpdateCache()
+{
+    qInfo().noquote() << QStringLiteral("=====================>> onUpdateCache, thread id : ") + threadId();
+    if (!isEnabled()) {
+        cleanDomainUserCacheFiles();
+        return;
+    }
+    m_users->rebuildUsers(m_http.get());
+}
+
+bool KestCacheService::isEnabled() const
+{
+    return GlobalSetting::instance()->isEnabled();
+}
+
+UserListManager *KestCacheService::userList() const
+{
+    return m_users.get();
+}
+
+QString KestCacheService::passReply(bool pass)
+{
+    return pass ? QStringLiteral("{\"pass\":true}") : QStringLiteral("{\"pass\":false}");
+}
+
+QString KestCacheService::statusReply(int code, const QString &message)
+{
+    const QJsonObject object { { QStringLiteral("code"), code }, { QStringLiteral("msg"), message },
+        { QStringLiteral("data"), QJsonValue::Null } };
+    return QString::fromUtf8(QJsonDocument(object).toJson(QJsonDocument::Compact));
+}
+
+bool KestCacheService::validateServerAnswer(const QString &reply, const QString &password, QJsonObject &user)
+{
+    if (reply == HttpHelper::refusedReply()) {
+        qWarning().noquote() << QStringLiteral("server refuse with data: ") + reply;
+        return false;
+    }
+    const QJsonObject object = QJsonDocument::fromJson(reply.toUtf8()).object();
+    const QJsonValue data = object.value(QLatin1String("data"));
+    if (!data.isObject() || !data.toObject().value(QLatin1String("user")).isObject()) {
+        qWarning().noquote() << QStringLiteral("web server does not correspond to client.");
+        return false;
+    }
+    user = data.toObject().value(QLatin1String("user")).toObject();
+    const double uid = user.value(QLatin1String("uid")).toDouble();
+    if (!(uid >= firstDomainUid) || uid > double(std::numeric_limits<uint>::max())) {
+        qWarning().noquote() << QStringLiteral("web server user uid is invalid. received raw data: ") + reply;
+        return false;
+    }
+    user.insert(QStringLiteral("password"),
+        password == shadowedPassword ? shadowedPassword : UserListManager::passwordDigest(password));
+    return true;
+}
+
+QString KestCacheService::answerLookup(
+    const QString &reply, bool known, const QString &offlineMessage, const QString &unknownMessage)
+{
+    if (reply == HttpHelper::unreachableReply()) {
+        if (known)
+            return passReply(true);
+        qWarning().noquote() << offlineMessage;
+        return passReply(false);
+    }
+    if (reply == HttpHelper::unknownAccountReply()) {
+        qWarning().noquote() << unknownMessage;
+        return passReply(false);
+    }
+    QJsonObject user;
+    if (!validateServerAnswer(reply, shadowedPassword, user))
+        return passReply(false);
+    m_users->addUser(user);
+    return passReply(true);
+}
+
+QString KestCacheService::queryAccountName(QString name)
+{
+    if (!isEnabled())
+        return passReply(false);
+    const QString reply = m_http->queryUserByName(name);
+    return answerLookup(reply, m_users->hasUserName(name),
+        QStringLiteral("offline cache doesnot persist account name: ") + name,
+        QStringLiteral("web server doesnot have account name: ") + name);
+}
+
+QString KestCacheService::queryUid(uint uid)
+{
+    if (!isEnabled())
+        return passReply(false);
+    const QString reply = m_http->queryUserByUid(uid);
+    const QString id = QString::number(uid);
+    return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
+        QStringLiteral("web server doesnot have account uid: ") + id);
+}
+
+QString KestCacheService::queryGroupName(QString name, QString baseJson)
+{
+    Q_UNUSED(name)
+    Q_UNUSED(baseJson)
+    isEnabled();
+    return passReply(false);
+}
+
+QString KestCacheService::queryGid(uint gid, QString baseJson)
+{
+    Q_UNUSED(gid)
+    Q_UNUSED(baseJson)
+    isEnabled();
+    return passReply(false);
+}
+
+QString KestCacheService::authenticatePassword(QString username, QString password)
+{
+    if (!isEnabled())
+        return passReply(false);
+    if (password == shadowedPassword) {
+        qWarning().noquote() << QStringLiteral(
+            "password should not be x because linux use it to express encrypted password meaning.");
+        return passReply(false);
+    }
+    const QString reply = m_http->authenticate(username, password, QStringLiteral("password"));
+    if (reply == HttpHelper::unreachableReply()) {
+        if (!checkOfflineLogin(username) || !m_users->checkOfflinePassword(username, password))
+            return passReply(false);
+        qInfo().noquote() << QStringLiteral("[authenticatePassword]: Offline login verification successful");
+        return passReply(true);
+    }
+    if (reply == HttpHelper::refusedReply()) {
+        qWarning().noquote() << QStringLiteral("web server does not correspond to client.");
+        return passReply(false);
+    }
+    const QJsonObject answer = QJsonDocument::fromJson(reply.toUtf8()).object();
+    const QJsonValue result = answer.value(QLatin1String("data")).toObject().value(QLatin1String("result"));
+    if (answer.value(QLatin1String("code")).toInt() != 0 || !answer.contains(QLatin1String("data")) || !result.isBool()
+        || !result.toBool()) {
+        qInfo().noquote() << QStringLiteral("authenticate for user: ") + username
+                + QStringLiteral(", server returned: ") + reply + QStringLiteral(", compare result: ")
+                + QStringLiteral("false");
+        return passReply(false);
+    }
+    QJsonObject user;
+    if (!validateServerAnswer(m_http->queryUserByName(username), password, user)) {
+        qWarning().noquote() << QStringLiteral("user passed by web server but lost themself identification.");
+        return passReply(false);
+    }
+    m_users->addUser(user);
+    m_users->recordLogin(username);
+    HomeDirectoryRepair::repair(username, *m_users);
+    return passReply(true);
+}
+
+QString KestCacheService::modifyUser(QString json)
+{
+    if (!isEnabled())
+        return passReply(false);
+    const QJsonDocument document = QJsonDocument::fromJson(json.toUtf8());
+    if (!document.isObject()) {
+        qWarning().noquote() << QStringLiteral("invalid json string");
+        return statusReply(1, QStringLiteral("json解析失败"));
+    }
+    const QJsonObject request = document.object();
+    if (!request.contains(QLatin1String("username")) || !request.contains(QLatin1String("password"))
+        || !request.contains(QLatin1String("old_password"))) {
+        qWarning().noquote() << QStringLiteral("required json filed is missing.");
+        return statusReply(2, QStringLiteral("json解析失败,缺少必要的字段"));
+    }
+    const QString userName = request.value(QLatin1String("username")).toString();
+    const QString newPassword = request.value(QLatin1String("password")).toString();
+    const QString oldPassword = request.value(QLatin1String("old_password")).toString();
+    const uint uid = m_users->uidOfName(userName);
+    if (uid < firstDomainUid) {
+        qWarning().noquote() << QStringLiteral("donot validate for not remote account.");
+        return statusReply(3, QStringLiteral("校验域账号失败,不能查询到此账户信息"));
+    }
+    const QString reply = m_http->resetPassword(uid, userName, newPassword, oldPassword);
+    if (reply == HttpHelper::unreachableReply() || reply == HttpHelper::refusedReply()) {
+        qWarning().noquote() << QStringLiteral("network error or donot authenticate pass.");
+        return statusReply(4, QStringLiteral("网络错误,无法修改密码"));
+    }
+    // Only a change the server accepted may replace the digest kept for offline logins.
+    if (QJsonDocument::fromJson(reply.toUtf8()).object().value(QLatin1String("code")).toInt(-1) != 0)
+        return reply;
+    QJsonObject user;
+    if (!validateServerAnswer(m_http->queryUserByName(userName), newPassword, user))
+        qWarning().noquote() << QStringLiteral("web server successed, but lost user detail information");
+    else
+        m_users->addUser(user);
+    return reply;
+}
+
+QString KestCacheService::changePassword(
+    const QString &userName, const QString &newPassword, const QString &oldPassword)
+{
+    if (!isEnabled())
+        return passReply(false);
+    return m_http->resetPassword(m_users->uidOfName(userName), userName, newPassword, oldPassword);
+}

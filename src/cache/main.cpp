@@ -1,0 +1,169 @@
+// Entry of cache-kest: the cache daemon without arguments, its command-line client with them.
+#include "common.h"
+#include "globalsetting.h"
+#include "kestcacheclient.h"
+#include "kestcachelocalserver.h"
+#include "kestcacheservice.h"
+#include "kestpaths.h"
+#include "messagehandler.h"
+
+#include <QCommandLineParser>
+#include <QCoreApplication>
+#include <QDebug>
+#include <QFile>
+#include <QHostAddress>
+#include <QSaveFile>
+#include <QSocketNotifier>
+#include <QTextStream>
+#include <QTimer>
+
+#include <csignal>
+#include <sys/socket.h>
+#include <unistd.h>
+
+namespace
+{
+const int replyTimeoutMs = 30000;
+int signalPipe[2] = { -1, -1 };
+
+void onTerminateSignal(int)
+{
+    const char byte = 1;
+    // Only async-signal-safe work here; the event loop does the rest.
+    [[maybe_unused]] const ssize_t written = write(signalPipe[0], &byte, 1);
+}
+
+bool installSignalHandlers(QCoreApplication &app)
+{
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, signalPipe) != 0)
+        return false;
+    auto *notifier = new QSocketNotifier(signalPipe[1], QSocketNotifier::Read, &app);
+    QObject::connect(notifier, &QSocketNotifier::activated, &app, &QCoreApplication::quit);
+    struct sigaction action = {};
+    action.sa_handler = onTerminateSignal;
+    sigemptyset(&action.sa_mask);
+    action.sa_flags = SA_RESTART;
+    return sigaction(SIGTERM, &action, nullptr) == 0 && sigaction(SIGINT, &action, nullptr) == 0;
+}
+
+bool writePidFile(quint16 port)
+{
+    QSaveFile file(KestPaths::cachePidFile());
+    if (!file.open(QIODevice::WriteOnly | QIODevice::Text))
+        return false;
+    file.write(QByteArray::number(qint64(getpid())) + '\n' + QByteArray::number(port) + '\n');
+    file.setPermissions(
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
+    return file.commit();
+}
+
+int runDaemon(QCoreApplication &app)
+{
+    if (getuid() != 0) {
+        qWarning().noquote() << QStringLiteral("please run as root.");
+        return 2;
+    }
+    if (!installSignalHandlers(app))
+        qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
+
+    KestCacheLocalServer server(new KestCacheService);
+    const int port = GlobalSetting::instance()->port();
+    if (!server.listen(QHostAddress(QStringLiteral("127.0.0.1")), quint16(port))) {
+        qCritical().noquote() << QStringLiteral("cannot listen on 127.0.0.1:") + QString::number(port)
+                + QStringLiteral(", error: ") + server.errorString();
+        return 1;
+    }
+    if (!writePidFile(server.serverPort()))
+        qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
+    qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
+
+    const int result = app.exec();
+    server.close();
+    QFile::remove(KestPaths::cachePidFile());
+    qInfo().noquote() << QStringLiteral("cache service stopped.");
+    return result;
+}
+
+quint16 daemonPort()
+{
+    unsigned short port = 0;
+    if (QFile::exists(KestPaths::cachePidFile()) && read_port(&port))
+        return port;
+    return quint16(GlobalSetting::instance()->port());
+}
+
+int runClient(QCoreApplication &app, int command, const QByteArray &argument)
+{
+    QTextStream out(stdout);
+    QTextStream err(stderr);
+    if (command == 6)
+        return KestCacheClient::showCache(argument, out, err) ? 0 : 1;
+
+    KestCacheClient client;
+    const quint16 port = daemonPort();
+    if (!client.connectToServer(QStringLiteral("127.0.0.1"), port)) {
+        err << "cannot connect to cache-kest on 127.0.0.1:" << port << Qt::endl;
+        return 1;
+    }
+    QObject::connect(&client, &KestCacheClient::replyReceived, &app, [&](const QByteArray &payload, bool isJson) {
+        if (!isJson) {
+            err << "parse json error" << Qt::endl;
+            app.exit(1);
+            return;
+        }
+        out << QString::fromUtf8(payload) << Qt::endl;
+        app.exit(0);
+    });
+    QTimer::singleShot(replyTimeoutMs, &app, [&]() {
+        err << "no reply from cache-kest within " << replyTimeoutMs / 1000 << " s" << Qt::endl;
+        app.exit(1);
+    });
+    client.sendCommand(command, argument);
+    return app.exec();
+}
+} // namespace
+
+int main(int argc, char *argv[])
+{
+    qInstallMessageHandler(messageHandler);
+    QCoreApplication app(argc, argv);
+    QCoreApplication::setApplicationName(QStringLiteral("cache-kest"));
+    QCoreApplication::setApplicationVersion(QStringLiteral("1.0"));
+    if (QCoreApplication::arguments().size() <= 1)
+        return runDaemon(app);
+
+    QCommandLineParser parser;
+    parser.setApplicationDescription(QStringLiteral(
+        "Without options: the kest-iam cache daemon. With one option: a command to the running daemon."));
+    parser.addHelpOption();
+    parser.addVersionOption();
+    const QList<QPair<int, QCommandLineOption>> commands {
+        { 1,
+            QCommandLineOption(QStringLiteral("clean-cache"), QStringLiteral("Delete the cache record of UID."),
+                QStringLiteral("UID")) },
+        { 2,
+            QCommandLineOption(QStringLiteral("clean-cache-not-in-list"),
+                QStringLiteral("Delete every cache record whose uid is not in {\"whitelist\":[...]}."),
+                QStringLiteral("JSON")) },
+        { 3,
+            QCommandLineOption(QStringLiteral("update-cache"), QStringLiteral("Refresh the cache record of UID."),
+                QStringLiteral("UID")) },
+        { 5,
+            QCommandLineOption(QStringLiteral("modify-user-passwd"),
+                QStringLiteral("Change a password: {\"username\",\"password\",\"old_password\"}."),
+                QStringLiteral("JSON")) },
+        { 6,
+            QCommandLineOption(QStringLiteral("show-cache"),
+                QStringLiteral("Print the cache record of UID (read locally)."), QStringLiteral("UID")) },
+    };
+    for (const auto &command : commands)
+        parser.addOption(command.second);
+    parser.process(app);
+
+    for (const auto &command : commands) {
+        if (parser.isSet(command.second))
+            return runClient(app, command.first, parser.value(command.second).toUtf8());
+    }
+    QTextStream(stderr) << parser.helpText();
+    return 1;
+}
