@@ -61,6 +61,14 @@ struct RecordFields {
     quint32 removeStatus = 0;
 };
 
+inline QStringList texts(const QList<QByteArray> &utf8)
+{
+    QStringList result;
+    for (const QByteArray &item : utf8)
+        result.append(QString::fromUtf8(item));
+    return result;
+}
+
 inline QByteArray recordFile(const RecordFields &fields, quint32 version = 0x01000000)
 {
     RecordBytes bytes;

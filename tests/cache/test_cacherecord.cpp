@@ -59,14 +59,6 @@ namespace
 {
 const quint32 kVersion = 0x01000000;
 
-QStringList texts(const QList<QByteArray> &utf8)
-{
-    QStringList result;
-    for (const QByteArray &item : utf8)
-        result.append(QString::fromUtf8(item));
-    return result;
-}
-
 // A stream device that cannot tell how much is left, like a pipe.
 class SequentialDevice : public QIODevice
 {
