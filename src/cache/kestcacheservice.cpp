@@ -147,6 +147,10 @@ QString KestCacheService::answerLookup(
     QJsonObject user;
     if (!validateServerAnswer(reply, shadowedPassword, user))
         return passReply(false);
+    // Network accounts carry their "@" on this machine, whichever way they were looked up.
+    const QString name = user.value(QLatin1String("name")).toString();
+    if (!name.startsWith(QLatin1Char('@')))
+        user.insert(QStringLiteral("name"), QLatin1Char('@') + name);
     m_users->addUser(user);
     return passReply(true);
 }
