@@ -206,7 +206,8 @@ QNetworkReply *HttpHelper::sendRequest(const QString &url, const QByteArray &met
 int HttpHelper::parseReply(QNetworkReply *reply, QJsonDocument &document)
 {
     const int status = reply->attribute(QNetworkRequest::HttpStatusCodeAttribute).toInt();
-    const QByteArray data = reply->readAll();
+    // An aborted reply is closed, and reading a closed device makes Qt log a complaint of its own.
+    const QByteArray data = reply->isOpen() ? reply->readAll() : QByteArray();
     QJsonParseError error;
     document = QJsonDocument::fromJson(data, &error);
     if (error.error != QJsonParseError::NoError) {

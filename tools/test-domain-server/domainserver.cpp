@@ -74,6 +74,10 @@ void DomainServer::handle(HttpConnection *connection, const HttpRequest &request
     case Misbehaviour::Kind::Close:
         connection->close();
         return;
+    case Misbehaviour::Kind::Redirect:
+        connection->respond(HttpResponse { 302, R"({"code":302,"msg":"moved","data":null})",
+                                           { { "Location", behaviour.target() } } });
+        return;
     case Misbehaviour::Kind::Status: {
         HttpResponse response = m_directory.answer(request);
         response.status = behaviour.value();

@@ -11,6 +11,8 @@ QByteArray reasonPhrase(int status)
     switch (status) {
     case 200:
         return "OK";
+    case 302:
+        return "Found";
     case 400:
         return "Bad Request";
     case 404:
@@ -41,8 +43,10 @@ void HttpConnection::respond(const HttpResponse &response)
     m_answered = true;
     QByteArray message = "HTTP/1.1 " + QByteArray::number(response.status) + ' ' + reasonPhrase(response.status)
         + "\r\nContent-Type: application/json\r\nContent-Length: " + QByteArray::number(response.body.size())
-        + "\r\nConnection: close\r\n\r\n" + response.body;
-    m_socket->write(message);
+        + "\r\nConnection: close\r\n";
+    for (auto it = response.headers.cbegin(); it != response.headers.cend(); ++it)
+        message += it.key() + ": " + it.value() + "\r\n";
+    m_socket->write(message + "\r\n" + response.body);
     m_socket->disconnectFromHost();
 }
 

@@ -12,6 +12,15 @@ struct HttpRequest {
 };
 
 struct HttpResponse {
-    int status = 200;
+    HttpResponse(int status = 200, const QByteArray &body = QByteArray(),
+                 const QMap<QByteArray, QByteArray> &headers = QMap<QByteArray, QByteArray>())
+        : status(status)
+        , body(body)
+        , headers(headers)
+    {
+    }
+
+    int status;
     QByteArray body;
+    QMap<QByteArray, QByteArray> headers; // besides Content-Type, Content-Length and Connection
 };

@@ -36,6 +36,11 @@ Misbehaviour Misbehaviour::parse(const QString &text)
         return behaviour;
     }
     const int colon = text.indexOf(QLatin1Char(':'));
+    if (colon > 0 && text.left(colon) == QLatin1String("redirect") && text.mid(colon + 1).startsWith(QLatin1Char('/'))) {
+        behaviour.m_kind = Kind::Redirect;
+        behaviour.m_target = text.mid(colon + 1).toUtf8();
+        return behaviour;
+    }
     bool ok = false;
     const int value = text.mid(colon + 1).toInt(&ok);
     const QString name = text.left(colon);

@@ -14,6 +14,7 @@ public:
         Status, // the normal answer's body with another status
         Delay, // the normal answer, sent late
         Close, // the connection is closed without an answer; the request is not carried out
+        Redirect, // status 302 to another path of this server; the request is not carried out
     };
 
     // The behaviour file maps request paths, or "*" for every other path, to a behaviour text.
@@ -24,8 +25,11 @@ public:
     Kind kind() const { return m_kind; }
     // The status of Status, the milliseconds of Delay.
     int value() const { return m_value; }
+    // The path of Redirect.
+    QByteArray target() const { return m_target; }
 
 private:
     Kind m_kind = Kind::None;
     int m_value = 0;
+    QByteArray m_target;
 };
