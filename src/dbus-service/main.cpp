@@ -1,0 +1,150 @@
+// Entry of dbus-kest: the front service on the system bus.
+#include "dbuskestservice.h"
+#include "kestpaths.h"
+#include "messagehandler.h"
+
+#include <QCoreApplication>
+#include <QDBusConnection>
+#include <QDBusConnectionInterface>
+#include <QDebug>
+#include <QFile>
+#include <QSharedMemory>
+#include <QSharedPointer>
+#include <QTimer>
+
+#include <csignal>
+#include <cstdlib>
+#include <unistd.h>
+
+namespace
+{
+const int kPidFileDelayMs = 5000;
+const QString kServiceName = QStringLiteral("com.nimbal.kest.iam");
+const QString kObjectPath = QStringLiteral("/com/nimbal/kest/iam");
+
+// Global so that the terminate-signal handler can release it.
+QSharedPointer<QSharedMemory> g_instanceGuard;
+
+void releaseInstanceGuard()
+{
+    if (!g_instanceGuard)
+        return;
+    g_instanceGuard->detach();
+    g_instanceGuard.reset();
+}
+
+void onTerminateSignal(int signalNumber)
+{
+    qInfo().noquote() << QStringLiteral("received terminate signal. ") + QString::number(signalNumber);
+    releaseInstanceGuard();
+    // The pid file stays: the next start replaces a stale one.
+    std::exit(signalNumber);
+}
+
+void installTerminateHandler()
+{
+    // SIGKILL cannot be caught; the request is kept all the same.
+    for (const int signalNumber : { SIGTERM, SIGKILL, SIGQUIT, SIGINT })
+        std::signal(signalNumber, onTerminateSignal);
+}
+
+// 0 once this process holds the guard, else the exit code.
+int takeInstanceGuard()
+{
+    g_instanceGuard = QSharedPointer<QSharedMemory>::create(QCoreApplication::applicationName());
+    if (g_instanceGuard->attach(QSharedMemory::ReadWrite)) {
+        qDebug().noquote() << QStringLiteral("Open Another Instance is forbidden");
+        return -1;
+    }
+    if (!g_instanceGuard->create(1, QSharedMemory::ReadWrite)) {
+        qCritical().noquote() << QStringLiteral("cannot create share memory. code: ")
+                + QString::number(g_instanceGuard->error()) + QStringLiteral(", ") + g_instanceGuard->errorString();
+        g_instanceGuard.reset();
+        return -4;
+    }
+    return 0;
+}
+
+void writePidFile()
+{
+    QFile file(KestPaths::dbusPidFile());
+    if (file.exists() && !file.remove()) {
+        qWarning().noquote() << QStringLiteral("can not remove invalid pid file.");
+        std::exit(3);
+    }
+    if (!file.open(QIODevice::Append | QIODevice::Text)) {
+        qWarning().noquote() << QStringLiteral("can not create pid file. error: ") + file.errorString();
+        std::exit(3);
+    }
+    file.setPermissions(
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
+    file.write(QByteArray::number(qint64(getpid())));
+    file.flush();
+    file.close();
+    qInfo().noquote() << QStringLiteral("dbus kest service is started.");
+}
+
+QDBusError serviceRegistrationError(const QDBusConnection &connection)
+{
+    if (connection.lastError().isValid())
+        return connection.lastError();
+    return connection.interface() ? connection.interface()->lastError() : QDBusError();
+}
+
+// 0 once the name and every object are on the bus, else the exit code.
+int registerOnBus(DBusKestService &service)
+{
+    QDBusConnection connection = QDBusConnection::systemBus();
+    if (!connection.registerService(kServiceName)) {
+        const QDBusError error = serviceRegistrationError(connection);
+        qWarning().noquote() << QStringLiteral("register dbus service failed. error: ") + error.name()
+                + QStringLiteral(", detail: ") + error.message();
+        return -2;
+    }
+    if (!connection.registerObject(kObjectPath, &service, QDBusConnection::ExportAllContents)) {
+        const QDBusError error = connection.lastError();
+        qWarning().noquote() << QStringLiteral("register dbus object failed. error: ") + error.name()
+                + QStringLiteral(", detail: ") + error.message();
+        return -3;
+    }
+    if (!service.registerUserObjects(connection)) {
+        qWarning().noquote() << QStringLiteral("register dbus object failed. error.");
+        return -3;
+    }
+    return 0;
+}
+} // namespace
+
+int main(int argc, char *argv[])
+{
+    qInstallMessageHandler(messageHandler);
+    QCoreApplication app(argc, argv);
+    QCoreApplication::setOrganizationName(QStringLiteral("Ardelvine"));
+    QCoreApplication::setApplicationName(QStringLiteral("dbus-kest"));
+    QCoreApplication::setApplicationVersion(QStringLiteral("1.0"));
+
+    // Any argument means: idle without touching the bus, the guard or the pid file.
+    if (argc > 1)
+        return app.exec();
+
+    installTerminateHandler();
+    if (getuid() != 0) {
+        qWarning().noquote() << QStringLiteral("please run as root.");
+        return 2;
+    }
+    if (const int code = takeInstanceGuard())
+        return code;
+    QFile::remove(KestPaths::dbusPidFile());
+
+    DBusKestService service;
+    if (const int code = registerOnBus(service))
+        return code;
+    qInfo().noquote() << QStringLiteral("dbus service started.");
+    QTimer::singleShot(kPidFileDelayMs, Qt::CoarseTimer, writePidFile);
+
+    const int result = app.exec();
+    g_instanceGuard->detach();
+    QFile::remove(KestPaths::dbusPidFile());
+    g_instanceGuard.reset();
+    return result;
+}
