@@ -1,6 +1,8 @@
 #include "cachecontrolfactory.h"
 #include "cachestore.h"
+#include "domainserverfixture.h"
 #include "grouplistmanager.h"
+#include "httphelper.h"
 #include "messagehandler.h"
 #include "syslogcapture.h"
 #include "testroot.h"
@@ -243,6 +245,39 @@ private Q_SLOTS:
         // A later refresh of the account keeps the time of the last login.
         users.addUser(userObject(QStringLiteral("@alice"), 10001, QStringLiteral("x")));
         QVERIFY(record(10001)->lastLoginTime() >= before);
+    }
+
+    void rebuildAgainstTheDomainServer()
+    {
+        TestRoot root;
+        DomainServerFixture server;
+        QVERIFY2(server.isValid() && server.start(), qPrintable(server.errorText()));
+        QVERIFY(root.writeSettings(server.settingsIni({ { QStringLiteral("main/network-timeout"), 2 } })));
+        QVERIFY(writeRecord(10001, QStringLiteral("@alice")));
+        QVERIFY(writeRecord(10099, QStringLiteral("@ghost")));
+        GroupListManager groups;
+        UserListManager users(&groups);
+        users.addUser(userObject(QStringLiteral("a"), 10050));
+        QCOMPARE(users.users().size(), 3);
+        HttpHelper http;
+
+        SyslogCapture::clear();
+        users.rebuildUsers(&http);
+        QCOMPARE(SyslogCapture::count("abnormal user, remove cache now. user: @ghost"), 1);
+        QCOMPARE(SyslogCapture::count("abnormal user, remove cache now. user: "), 1);
+        QVERIFY(!QFile::exists(root.filePath(QStringLiteral("/var/lib/libkest-iam/10099"))));
+        QCOMPARE(users.users().size(), 1);
+        const UserEntryPtr alice = users.entryOfUid(10001);
+        QVERIFY(alice);
+        QCOMPARE(alice->gecos, QStringLiteral("Alice"));
+        QCOMPARE(record(10001)->gecos(), QStringLiteral("Alice"));
+        // The digest of the last login survives the refresh.
+        QVERIFY(users.checkOfflinePassword(QStringLiteral("@alice"), QStringLiteral("secret")));
+
+        server.stop();
+        users.rebuildUsers(&http);
+        QCOMPARE(users.users().size(), 1);
+        QVERIFY(record(10001));
     }
 
     void unwritableSpecials()
