@@ -362,16 +362,6 @@ private Q_SLOTS:
         QVERIFY2(logged.first().contains(QStringLiteral(".     certificate error: ")), qPrintable(logged.first()));
     }
 
-    void clientCertificateIsRequired()
-    {
-        QVERIFY(writeSettings(
-            { { QStringLiteral("url/public-key"), QVariant() }, { QStringLiteral("url/private-key"), QVariant() } }));
-        HttpHelper helper;
-        const std::unique_ptr<QNetworkReply> reply(helper.sendRequest(url("/v1/domain/"), "GET", QByteArray(), true));
-        QVERIFY(reply->error() != QNetworkReply::NoError);
-        QVERIFY(m_server->requests().isEmpty());
-    }
-
     void readMachineId_data()
     {
         QTest::addColumn<QByteArray>("content"); // null: no file
