@@ -172,7 +172,7 @@ QNetworkReply *HttpHelper::sendRequest(const QString &url, const QByteArray &met
     request.setHeader(QNetworkRequest::ContentTypeHeader, QStringLiteral("application/json"));
     request.setHeader(QNetworkRequest::UserAgentHeader, QStringLiteral("KEST"));
     request.setAttribute(QNetworkRequest::RedirectPolicyAttribute, QNetworkRequest::ManualRedirectPolicy);
-    // Empty but not null: a null value would drop the header instead of sending it empty.
+    // Empty, not null (a null value removes a header): Qt's HTTP layer then puts in its own values.
     const QByteArray empty("");
     request.setRawHeader("Connection", empty);
     request.setRawHeader("Accept-Encoding", empty);
