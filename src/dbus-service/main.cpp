@@ -10,10 +10,12 @@
 #include <QFile>
 #include <QSharedMemory>
 #include <QSharedPointer>
+#include <QSocketNotifier>
 #include <QTimer>
 
 #include <csignal>
 #include <cstdlib>
+#include <fcntl.h>
 #include <unistd.h>
 
 namespace
@@ -24,6 +26,8 @@ const QString kObjectPath = QStringLiteral("/com/nimbal/kest/iam");
 
 // Global so that the terminate-signal handler can release it.
 QSharedPointer<QSharedMemory> g_instanceGuard;
+int g_signalPipe[2] = { -1, -1 };
+int g_terminatingSignal = 0;
 
 void releaseInstanceGuard()
 {
@@ -35,17 +39,36 @@ void releaseInstanceGuard()
 
 void onTerminateSignal(int signalNumber)
 {
-    qInfo().noquote() << QStringLiteral("received terminate signal. ") + QString::number(signalNumber);
-    releaseInstanceGuard();
-    // The pid file stays: the next start replaces a stale one.
-    std::exit(signalNumber);
+    const char number = char(signalNumber);
+    // Only async-signal-safe work here. Logging, releasing the guard and leaving happen on the event loop:
+    // leaving from inside the handler can deadlock against the bus thread on a lock the interrupted code holds.
+    [[maybe_unused]] const ssize_t written = ::write(g_signalPipe[1], &number, 1);
 }
 
-void installTerminateHandler()
+void terminate(int signalNumber)
 {
+    qInfo().noquote() << QStringLiteral("received terminate signal. ") + QString::number(signalNumber);
+    releaseInstanceGuard();
+    g_terminatingSignal = signalNumber;
+    QCoreApplication::exit(signalNumber);
+}
+
+bool installTerminateHandler(QCoreApplication &app)
+{
+    if (::pipe2(g_signalPipe, O_CLOEXEC | O_NONBLOCK) != 0) {
+        qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
+        return false;
+    }
+    auto *notifier = new QSocketNotifier(g_signalPipe[0], QSocketNotifier::Read, &app);
+    QObject::connect(notifier, &QSocketNotifier::activated, &app, []() {
+        char number = 0;
+        if (::read(g_signalPipe[0], &number, 1) == 1)
+            terminate(number);
+    });
     // SIGKILL cannot be caught; the request is kept all the same.
     for (const int signalNumber : { SIGTERM, SIGKILL, SIGQUIT, SIGINT })
         std::signal(signalNumber, onTerminateSignal);
+    return true;
 }
 
 // 0 once this process holds the guard, else the exit code.
@@ -127,7 +150,7 @@ int main(int argc, char *argv[])
     if (argc > 1)
         return app.exec();
 
-    installTerminateHandler();
+    installTerminateHandler(app);
     if (getuid() != 0) {
         qWarning().noquote() << QStringLiteral("please run as root.");
         return 2;
@@ -143,8 +166,10 @@ int main(int argc, char *argv[])
     QTimer::singleShot(kPidFileDelayMs, Qt::CoarseTimer, writePidFile);
 
     const int result = app.exec();
-    g_instanceGuard->detach();
+    // A terminate signal has released the guard already and leaves the pid file for the next start.
+    if (g_terminatingSignal != 0)
+        return result;
+    releaseInstanceGuard();
     QFile::remove(KestPaths::dbusPidFile());
-    g_instanceGuard.reset();
     return result;
 }
