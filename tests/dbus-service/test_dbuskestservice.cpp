@@ -323,6 +323,26 @@ private Q_SLOTS:
         QVERIFY(service.stop());
     }
 
+    void startedSwitchedOff()
+    {
+        QVERIFY(writeCacheRecords(threeUsers));
+        QVERIFY(writeCacheRecord(testAccount(1005, QStringLiteral("localuser"))));
+        QVERIFY(m_root.writeSettings("[main]\nenable=false\n"));
+        ServiceProcess service;
+        QVERIFY(service.start());
+        QVERIFY(service.waitUntilServing(m_connection));
+        QCOMPARE(cachedUids(), QList<uint> { 1005 });
+
+        // Switching on later does not start the session watch: a new session rebuilds nothing.
+        QVERIFY(m_root.writeSettings("[main]\nenable=true\n"));
+        QVERIFY(writeCacheRecord(testAccount(10001, QStringLiteral("@alice"))));
+        QVERIFY(m_peers.addSession(QStringLiteral("c8"), 10001, QStringLiteral("@alice")));
+        announce(QStringLiteral("c8"));
+        QCOMPARE(m_peers.calls(), QStringList());
+        QVERIFY(!userProperty(m_connection, 10001, QStringLiteral("Uid")).isValid());
+        QVERIFY(service.stop());
+    }
+
     void enableOverTheBus()
     {
         QVERIFY(writeCacheRecords(threeUsers));

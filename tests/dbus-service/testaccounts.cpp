@@ -27,7 +27,8 @@ bool writeCacheRecord(const TestAccount &account)
     const QJsonObject json { { QStringLiteral("version"), 16777216 }, { QStringLiteral("uid"), qint64(account.uid) },
         { QStringLiteral("account"), account.name }, { QStringLiteral("main_gid"), qint64(account.gid) },
         { QStringLiteral("home_path"), account.home }, { QStringLiteral("login_shell"), account.shell },
-        { QStringLiteral("gecos"), account.gecos }, { QStringLiteral("password"), account.password } };
+        { QStringLiteral("gecos"), account.gecos }, { QStringLiteral("password"), account.password },
+        { QStringLiteral("remove_status"), qint64(account.removeStatus) } };
     CacheControlPtr record = createCacheControl();
     if (!cacheRecordFromJson(record, QString::fromUtf8(QJsonDocument(json).toJson(QJsonDocument::Compact))))
         return false;
@@ -66,7 +67,7 @@ QDBusMessage callService(const QDBusConnection &bus, const QString &member, cons
     QDBusMessage call
         = QDBusMessage::createMethodCall(serviceName, servicePath(), QStringLiteral("com.nimbal.kest.iam"), member);
     call.setArguments(arguments);
-    return bus.call(call, QDBus::Block, callTimeoutMs);
+    return bus.call(call, QDBus::BlockWithGui, callTimeoutMs);
 }
 
 QVariant userProperty(const QDBusConnection &bus, uint uid, const QString &property)
@@ -74,7 +75,7 @@ QVariant userProperty(const QDBusConnection &bus, uint uid, const QString &prope
     QDBusMessage call
         = QDBusMessage::createMethodCall(serviceName, userObjectPath(uid), propertiesInterface, QStringLiteral("Get"));
     call << QStringLiteral("com.nimbal.kest.iam.user") << property;
-    const QDBusMessage reply = bus.call(call, QDBus::Block, callTimeoutMs);
+    const QDBusMessage reply = bus.call(call, QDBus::BlockWithGui, callTimeoutMs);
     if (reply.type() != QDBusMessage::ReplyMessage || reply.arguments().isEmpty())
         return QVariant();
     return reply.arguments().constFirst().value<QDBusVariant>().variant();
@@ -86,5 +87,5 @@ QDBusMessage setEnableProperty(const QDBusConnection &bus, bool enable)
         = QDBusMessage::createMethodCall(serviceName, servicePath(), propertiesInterface, QStringLiteral("Set"));
     call << QStringLiteral("com.nimbal.kest.iam") << QStringLiteral("Enable")
          << QVariant::fromValue(QDBusVariant(enable));
-    return bus.call(call, QDBus::Block, callTimeoutMs);
+    return bus.call(call, QDBus::BlockWithGui, callTimeoutMs);
 }

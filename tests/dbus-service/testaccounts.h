@@ -16,6 +16,7 @@ struct TestAccount {
     QString home;
     QString shell;
     QString gecos;
+    uint removeStatus = 0;
 };
 
 TestAccount testAccount(uint uid, const QString &name);
@@ -27,7 +28,8 @@ QList<uint> cachedUids();
 
 QString servicePath();
 QString userObjectPath(uint uid);
-// A blocking call of the front service's main interface.
+// A call of the front service's main interface; events are processed meanwhile, so the service may also live in
+// the calling process.
 QDBusMessage callService(
     const QDBusConnection &bus, const QString &member, const QVariantList &arguments = QVariantList());
 // A property of a per-user object; invalid when the object or property is not there.
