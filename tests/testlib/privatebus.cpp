@@ -89,6 +89,13 @@ bool PrivateBus::isRunning() const
     return !m_address.isEmpty() && m_daemon.state() == QProcess::Running;
 }
 
+bool PrivateBus::openToOtherUsers()
+{
+    // Traverse only: others reach the socket by name but cannot list or change the directory.
+    return QFile::setPermissions(m_dir.path(), QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner
+                                     | QFileDevice::ExeGroup | QFileDevice::ExeOther);
+}
+
 QString PrivateBus::address() const
 {
     return m_address;

@@ -20,6 +20,8 @@ public:
     PrivateBus &operator=(const PrivateBus &) = delete;
 
     bool isRunning() const;
+    // Lets processes of other users reach the bus socket (its directory is private to root otherwise).
+    bool openToOtherUsers();
     QString address() const;
     QString errorText() const;
 
