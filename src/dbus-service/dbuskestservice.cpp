@@ -51,7 +51,7 @@ const PolicyKey kPasswordPolicy[] = {
     { "pw_strength", "required", PolicyType::Int },
     { "pw_strength", "special_enable", PolicyType::Bool },
     { "pw_strength", "special_string", PolicyType::Text },
-    // A boolean although "required" beside it is a number: the password dialogs read it so.
+    // Deliberately a boolean, unlike the numeric "required" beside it.
     { "pw_strength", "strength", PolicyType::Bool },
     { "pw_strength", "upper", PolicyType::Bool },
     { "pw_validity", "enable", PolicyType::Bool },
@@ -105,7 +105,6 @@ DBusKestService::DBusKestService(const QDBusConnection &connection, QObject *par
     , m_connection(connection)
 {
     registerKestDBusTypes();
-    m_users.clear();
     if (isEnabled())
         watchLoginSessions();
     else

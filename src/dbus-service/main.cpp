@@ -24,7 +24,7 @@ const int kPidFileDelayMs = 5000;
 const QString kServiceName = QStringLiteral("com.nimbal.kest.iam");
 const QString kObjectPath = QStringLiteral("/com/nimbal/kest/iam");
 
-// Global so that the terminate-signal handler can release it.
+// Process-global: the terminate path releases it outside main.
 QSharedPointer<QSharedMemory> g_instanceGuard;
 int g_signalPipe[2] = { -1, -1 };
 int g_terminatingSignal = 0;
@@ -45,7 +45,7 @@ void onTerminateSignal(int signalNumber)
     [[maybe_unused]] const ssize_t written = ::write(g_signalPipe[1], &number, 1);
 }
 
-void terminate(int signalNumber)
+void leaveOnSignal(int signalNumber)
 {
     qInfo().noquote() << QStringLiteral("received terminate signal. ") + QString::number(signalNumber);
     releaseInstanceGuard();
@@ -53,22 +53,21 @@ void terminate(int signalNumber)
     QCoreApplication::exit(signalNumber);
 }
 
-bool installTerminateHandler(QCoreApplication &app)
+void installTerminateHandler(QCoreApplication &app)
 {
     if (::pipe2(g_signalPipe, O_CLOEXEC | O_NONBLOCK) != 0) {
         qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
-        return false;
+        return;
     }
     auto *notifier = new QSocketNotifier(g_signalPipe[0], QSocketNotifier::Read, &app);
     QObject::connect(notifier, &QSocketNotifier::activated, &app, []() {
         char number = 0;
         if (::read(g_signalPipe[0], &number, 1) == 1)
-            terminate(number);
+            leaveOnSignal(number);
     });
     // SIGKILL cannot be caught; the request is kept all the same.
     for (const int signalNumber : { SIGTERM, SIGKILL, SIGQUIT, SIGINT })
         std::signal(signalNumber, onTerminateSignal);
-    return true;
 }
 
 // 0 once this process holds the guard, else the exit code.
