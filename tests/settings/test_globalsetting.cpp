@@ -74,7 +74,7 @@ private Q_SLOTS:
             // The same key in another group must not be taken ("buffer-limit" of passwd and group, say).
             const QByteArray otherGroup = qstrcmp(key.group, "group") == 0 ? "passwd" : "group";
             QTest::addRow("%s/%s elsewhere", key.group, key.key)
-                << i << "[" + otherGroup + "]\n" + key.key + "=" + key.written + "\nencryption=x\n"
+                << i << "[" + otherGroup + "]\n" + key.key + "=" + key.written + "\n[main]\nencryption=x\n"
                 << false;
             QTest::addRow("%s/%s set", key.group, key.key)
                 << i << "[" + QByteArray(key.group) + "]\n" + key.key + "=" + key.written + "\n"
