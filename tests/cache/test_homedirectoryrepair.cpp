@@ -26,105 +26,65 @@ class HomeDirectoryRepairTest : public QObject
 {
     Q_OBJECT
 
-private:
-    TestRoot *m_root = nullptr;
-    GroupListManager *m_groups = nullptr;
-    UserListManager *m_users = nullptr;
-
-    QString home() const { return m_root->filePath(QStringLiteral("/home/@alice")); }
-
 private Q_SLOTS:
     void initTestCase() { qInstallMessageHandler(messageHandler); }
 
-    void init()
+    void repair_data()
     {
-        SyslogCapture::clear();
-        m_root = new TestRoot;
-        m_groups = new GroupListManager;
-        m_users = new UserListManager(m_groups);
-        m_users->addUser(QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") },
-            { QStringLiteral("uid"), 10001 }, { QStringLiteral("password"), QStringLiteral("x") } });
-        SyslogCapture::clear();
+        QTest::addColumn<QString>("user");
+        QTest::addColumn<QStringList>("entries"); // a trailing "/" makes a directory
+        QTest::addColumn<uint>("owner"); // the home's owner before
+        QTest::addColumn<QByteArray>("logged");
+        QTest::newRow("no home") << QStringLiteral("@alice") << QStringList() << 0u
+                                 << QByteArray("user home directory is not exists.");
+        QTest::newRow("unknown user") << QStringLiteral("@bob") << QStringList { QStringLiteral("f") } << 0u
+                                      << QByteArray("cannot find user id: @bob");
+        QTest::newRow("already owned") << QStringLiteral("@alice") << QStringList { QStringLiteral("f") } << 10001u
+                                       << QByteArray(" owner @alice is already right.");
+        QTest::newRow("files, hidden ones not counted")
+            << QStringLiteral("@alice")
+            << QStringList { QStringLiteral("a"), QStringLiteral("b"), QStringLiteral(".profile"),
+                   QStringLiteral(".cache/") }
+            << 0u << QByteArray("changed user:  @alice  home  0  directories and  2  files");
+        QTest::newRow("subdirectories end the walk")
+            << QStringLiteral("@alice")
+            << QStringList { QStringLiteral("a"), QStringLiteral("docs/"), QStringLiteral("music/") } << 0u
+            << QByteArray("changed user:  @alice  home  2  directories and  1  files");
     }
 
-    void cleanup()
+    void repair()
     {
-        delete m_users;
-        delete m_groups;
-        delete m_root;
-    }
+        QFETCH(QString, user);
+        QFETCH(QStringList, entries);
+        QFETCH(uint, owner);
+        QFETCH(QByteArray, logged);
+        TestRoot root;
+        GroupListManager groups;
+        UserListManager users(&groups);
+        users.addUser(
+            QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") }, { QStringLiteral("uid"), 10001 } });
+        const QString home = root.filePath(QStringLiteral("/home/") + user);
+        for (const QString &entry : qAsConst(entries))
+            QVERIFY(entry.endsWith(QLatin1Char('/'))
+                    ? QDir().mkpath(home + QLatin1Char('/') + entry + QStringLiteral("inner"))
+                    : root.writeFile(QStringLiteral("/home/") + user + QLatin1Char('/') + entry, "x"));
+        QVERIFY(entries.isEmpty() || chown(QFile::encodeName(home).constData(), owner, 0) == 0);
+        const mode_t before = statOf(home).st_mode;
+        SyslogCapture::clear();
 
-    void missingHome()
-    {
-        HomeDirectoryRepair::repair(QStringLiteral("@alice"), *m_users);
-        QCOMPARE(SyslogCapture::count("user home directory is not exists."), 1);
+        HomeDirectoryRepair::repair(user, users);
         QCOMPARE(SyslogCapture::lines().size(), 1);
-    }
-
-    void unknownUser()
-    {
-        QVERIFY(QDir().mkpath(m_root->filePath(QStringLiteral("/home/@bob"))));
-        HomeDirectoryRepair::repair(QStringLiteral("@bob"), *m_users);
-        QCOMPARE(SyslogCapture::count("cannot find user id: @bob"), 1);
-        QCOMPARE(statOf(m_root->filePath(QStringLiteral("/home/@bob"))).st_uid, uid_t(0));
-    }
-
-    void alreadyOwnedIsLeftAlone()
-    {
-        QVERIFY(QDir().mkpath(home()));
-        QVERIFY(m_root->writeFile(QStringLiteral("/home/@alice/file"), "data"));
-        QCOMPARE(chown(QFile::encodeName(home()).constData(), 10001, 0), 0);
-        const mode_t modeBefore = statOf(home()).st_mode;
-        HomeDirectoryRepair::repair(QStringLiteral("@alice"), *m_users);
-        QCOMPARE(SyslogCapture::count("directory " + QFile::encodeName(home()) + " owner @alice is already right."), 1);
-        QCOMPARE(statOf(home()).st_mode, modeBefore);
-        QCOMPARE(statOf(home()).st_gid, gid_t(0));
-    }
-
-    void walk_data()
-    {
-        QTest::addColumn<QStringList>("files");
-        QTest::addColumn<QStringList>("directories");
-        QTest::addColumn<QByteArray>("summary");
-
-        QTest::newRow("files only") << QStringList { QStringLiteral("a"), QStringLiteral("b"), QStringLiteral("c") }
-                                    << QStringList() << QByteArray("0  directories and  3  files");
-        QTest::newRow("hidden entries are not counted")
-            << QStringList { QStringLiteral("a"), QStringLiteral(".profile") }
-            << QStringList { QStringLiteral(".cache") } << QByteArray("0  directories and  1  files");
-        QTest::newRow("a subdirectory ends the walk")
-            << QStringList { QStringLiteral("a") } << QStringList { QStringLiteral("docs"), QStringLiteral("music") }
-            << QByteArray("2  directories and  1  files");
-        QTest::newRow("empty") << QStringList() << QStringList() << QByteArray("0  directories and  0  files");
-    }
-
-    void walk()
-    {
-        QFETCH(QStringList, files);
-        QFETCH(QStringList, directories);
-        QFETCH(QByteArray, summary);
-        QVERIFY(QDir().mkpath(home()));
-        for (const QString &directory : qAsConst(directories))
-            QVERIFY(QDir(home()).mkpath(directory + QStringLiteral("/inner")));
-        for (const QString &file : qAsConst(files))
-            QVERIFY(m_root->writeFile(QStringLiteral("/home/@alice/") + file, "data"));
-
-        HomeDirectoryRepair::repair(QStringLiteral("@alice"), *m_users);
-        const QList<SyslogLine> done = SyslogCapture::matching("changed user: ");
-        QCOMPARE(done.size(), 1);
-        QVERIFY2(done.first().text.endsWith("changed user:  @alice  home  " + summary), done.first().text.constData());
-        QCOMPARE(done.first().priority, 6);
-
-        const struct stat info = statOf(home());
-        QCOMPARE(info.st_uid, uid_t(10001));
-        QCOMPARE(info.st_gid, gid_t(10000));
-        if (directories.isEmpty() && !files.isEmpty())
-            QCOMPARE(info.st_mode & 07777, mode_t(0x640));
+        QVERIFY2(SyslogCapture::lines().first().text.endsWith(logged), SyslogCapture::lines().first().text);
+        const bool changed = logged.startsWith("changed");
+        QCOMPARE(statOf(home).st_uid, changed ? uid_t(10001) : uid_t(owner));
+        QCOMPARE(statOf(home).st_gid, changed ? gid_t(10000) : gid_t(0));
+        if (!changed)
+            QCOMPARE(statOf(home).st_mode, before);
+        else if (logged.contains("  0  directories"))
+            QCOMPARE(statOf(home).st_mode & 07777, mode_t(0x640));
         // The walk changes the directories that hold entries, never the entries themselves.
-        for (const QString &file : qAsConst(files))
-            QCOMPARE(statOf(home() + QLatin1Char('/') + file).st_uid, uid_t(0));
-        for (const QString &directory : qAsConst(directories))
-            QCOMPARE(statOf(home() + QLatin1Char('/') + directory).st_uid, uid_t(0));
+        for (const QString &entry : qAsConst(entries))
+            QCOMPARE(statOf(home + QLatin1Char('/') + entry).st_uid, uid_t(0));
     }
 };
 
