@@ -315,6 +315,15 @@ private Q_SLOTS:
         QCOMPARE(second.exitCode(), 1);
         QCOMPARE(setup.root.readFile(QStringLiteral("/run/cache-kest.pid")), pidFile);
 
+        QCOMPARE(setup.daemon.runClient({ QStringLiteral("--version") }, &out), 0);
+        QCOMPARE(out, QByteArray("cache-kest 1.0\n"));
+        QProcess notRoot;
+        notRoot.start(QStringLiteral("setpriv"),
+            { QStringLiteral("--reuid=65534"), QStringLiteral("--regid=65534"), QStringLiteral("--clear-groups"),
+                CacheDaemonFixture::programPath() });
+        QVERIFY(notRoot.waitForFinished(15000));
+        QCOMPARE(notRoot.exitCode(), 2);
+
         QCOMPARE(setup.daemon.stop(), 0);
         QVERIFY(!QFile::exists(setup.root.filePath(QStringLiteral("/run/cache-kest.pid"))));
         QCOMPARE(setup.daemon.runClient({ QStringLiteral("--clean-cache"), QStringLiteral("1") }, &out, &err), 1);
