@@ -3,6 +3,7 @@
 #include "cachestore.h"
 #include "kestcacheservice.h"
 #include "kestpaths.h"
+#include "passwordpolicy.h"
 
 #include <QDebug>
 #include <QFile>
@@ -31,47 +32,6 @@ const FunctionSpec functions[] = {
     { "authenticatePassword", 2 },
     { "modifyUser", 1 },
 };
-
-struct PolicyKey {
-    const char *key;
-    QJsonValue::Type type;
-};
-struct PolicyGroup {
-    const char *group;
-    QList<PolicyKey> keys;
-};
-
-const QList<PolicyGroup> &passwordPolicy()
-{
-    static const QList<PolicyGroup> groups {
-        { "pw_strength",
-            { { "character_enable", QJsonValue::Bool }, { "characters", QJsonValue::String },
-                { "contains_user", QJsonValue::Bool }, { "lower", QJsonValue::Bool },
-                { "max_length", QJsonValue::Double }, { "min_length", QJsonValue::Double },
-                { "number", QJsonValue::Bool }, { "required", QJsonValue::Double },
-                { "special_enable", QJsonValue::Bool }, { "special_string", QJsonValue::String },
-                { "strength", QJsonValue::Bool }, { "upper", QJsonValue::Bool } } },
-        { "pw_validity",
-            { { "enable", QJsonValue::Bool }, { "effective_time", QJsonValue::Double },
-                { "tip_time", QJsonValue::Double } } },
-        { "pw_history_check", { { "enable", QJsonValue::Bool }, { "history_num", QJsonValue::Double } } },
-        { "first_login", { { "enable", QJsonValue::Bool }, { "update_password", QJsonValue::Bool } } },
-        { "offline_login", { { "enable", QJsonValue::Bool }, { "cache_validity", QJsonValue::Double } } },
-    };
-    return groups;
-}
-
-QVariant settingOf(const QJsonValue &value, QJsonValue::Type type)
-{
-    switch (type) {
-    case QJsonValue::Bool:
-        return value.toVariant().toBool();
-    case QJsonValue::String:
-        return value.toVariant().toString();
-    default:
-        return value.toVariant().toInt();
-    }
-}
 
 QString compact(const QJsonObject &object)
 {
@@ -335,23 +295,14 @@ QString KestCacheLocalServer::passwordConfig(QTcpSocket *socket, const QJsonValu
     if (error.error != QJsonParseError::NoError)
         return sendResultReply(socket, 1, QStringLiteral("[PasswordConfig] : pw-config json parse error!!!"));
     const QJsonObject policy = document.object();
-    for (const PolicyGroup &group : passwordPolicy()) {
-        if (!policy.contains(QLatin1String(group.group)))
+    for (const char *group : PasswordPolicy::groupNames) {
+        if (!policy.contains(QLatin1String(group)))
             return sendResultReply(socket, 1,
                 QStringLiteral("[PasswordConfig] : pw-config json missing field,[pw_strength "
                                "pw_validity pw_history_check first_login offline_login]"));
     }
     QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    for (const PolicyGroup &group : passwordPolicy()) {
-        const QJsonObject values = policy.value(QLatin1String(group.group)).toObject();
-        settings.beginGroup(QLatin1String(group.group));
-        for (const PolicyKey &key : group.keys) {
-            if (values.contains(QLatin1String(key.key)))
-                settings.setValue(QLatin1String(key.key), settingOf(values.value(QLatin1String(key.key)), key.type));
-        }
-        settings.endGroup();
-    }
-    settings.sync();
+    PasswordPolicy::write(settings, policy);
     return sendResultReply(socket, 0, QString());
 }
 

@@ -6,6 +6,7 @@
 #include "globalsetting.h"
 #include "grouplistmanager.h"
 #include "kestpaths.h"
+#include "passwordpolicy.h"
 #include "userlistmanager.h"
 
 #include <QDBusInterface>
@@ -31,52 +32,6 @@ const QString kLogindPath = QStringLiteral("/org/freedesktop/login1");
 const QString kLogindManager = QStringLiteral("org.freedesktop.login1.Manager");
 const QString kUserObjectPath = QStringLiteral("/com/nimbal/kest/iam/user");
 const char kSyncTag[] = "syncLightDM";
-
-enum class PolicyType { Bool, Int, Text };
-
-struct PolicyKey {
-    const char *group;
-    const char *key;
-    PolicyType type;
-};
-
-const PolicyKey kPasswordPolicy[] = {
-    { "pw_strength", "character_enable", PolicyType::Bool },
-    { "pw_strength", "characters", PolicyType::Text },
-    { "pw_strength", "contains_user", PolicyType::Bool },
-    { "pw_strength", "lower", PolicyType::Bool },
-    { "pw_strength", "max_length", PolicyType::Int },
-    { "pw_strength", "min_length", PolicyType::Int },
-    { "pw_strength", "number", PolicyType::Bool },
-    { "pw_strength", "required", PolicyType::Int },
-    { "pw_strength", "special_enable", PolicyType::Bool },
-    { "pw_strength", "special_string", PolicyType::Text },
-    // Deliberately a boolean, unlike the numeric "required" beside it.
-    { "pw_strength", "strength", PolicyType::Bool },
-    { "pw_strength", "upper", PolicyType::Bool },
-    { "pw_validity", "enable", PolicyType::Bool },
-    { "pw_validity", "effective_time", PolicyType::Int },
-    { "pw_validity", "tip_time", PolicyType::Int },
-    { "pw_history_check", "enable", PolicyType::Bool },
-    { "pw_history_check", "history_num", PolicyType::Int },
-    { "first_login", "enable", PolicyType::Bool },
-    { "first_login", "update_password", PolicyType::Bool },
-    { "offline_login", "enable", PolicyType::Bool },
-    { "offline_login", "cache_validity", PolicyType::Int },
-};
-
-QJsonValue policyValue(const QVariant &value, PolicyType type)
-{
-    switch (type) {
-    case PolicyType::Bool:
-        return value.toBool();
-    case PolicyType::Int:
-        return value.toInt();
-    case PolicyType::Text:
-        break;
-    }
-    return value.toString();
-}
 
 QString errorText(const QDBusError &error)
 {
@@ -239,15 +194,7 @@ void DBusKestService::controlCacheService(bool enable)
 QString DBusKestService::QueryPasswordConfig()
 {
     const QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    QJsonObject config;
-    for (const PolicyKey &entry : kPasswordPolicy) {
-        const QString group = QLatin1String(entry.group);
-        const QString key = QLatin1String(entry.key);
-        QJsonObject values = config.value(group).toObject();
-        values.insert(key, policyValue(settings.value(group + QLatin1Char('/') + key), entry.type));
-        config.insert(group, values);
-    }
-    return QString::fromUtf8(QJsonDocument(config).toJson(QJsonDocument::Compact));
+    return QString::fromUtf8(QJsonDocument(PasswordPolicy::read(settings)).toJson(QJsonDocument::Compact));
 }
 
 UidList DBusKestService::GetUserIdList()
