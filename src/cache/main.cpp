@@ -6,6 +6,7 @@
 #include "kestcacheservice.h"
 #include "kestpaths.h"
 #include "messagehandler.h"
+#include "terminatesignalnotifier.h"
 
 #include <QCommandLineParser>
 #include <QCoreApplication>
@@ -13,39 +14,15 @@
 #include <QFile>
 #include <QHostAddress>
 #include <QSaveFile>
-#include <QSocketNotifier>
 #include <QTextStream>
 #include <QTimer>
 
 #include <csignal>
-#include <sys/socket.h>
 #include <unistd.h>
 
 namespace
 {
 const int replyTimeoutMs = 30000;
-int signalPipe[2] = { -1, -1 };
-
-void onTerminateSignal(int)
-{
-    const char byte = 1;
-    // Only async-signal-safe work here; the event loop does the rest.
-    [[maybe_unused]] const ssize_t written = write(signalPipe[0], &byte, 1);
-}
-
-bool installSignalHandlers(QCoreApplication &app)
-{
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, signalPipe) != 0)
-        return false;
-    auto *notifier = new QSocketNotifier(signalPipe[1], QSocketNotifier::Read, &app);
-    QObject::connect(notifier, &QSocketNotifier::activated, &app, &QCoreApplication::quit);
-    struct sigaction action = {};
-    action.sa_handler = onTerminateSignal;
-    sigemptyset(&action.sa_mask);
-    action.sa_flags = SA_RESTART;
-    return sigaction(SIGTERM, &action, nullptr) == 0 && sigaction(SIGINT, &action, nullptr) == 0;
-}
-
 bool writePidFile(quint16 port)
 {
     QSaveFile file(KestPaths::cachePidFile());
@@ -63,8 +40,10 @@ int runDaemon(QCoreApplication &app)
         qWarning().noquote() << QStringLiteral("please run as root.");
         return 2;
     }
-    if (!installSignalHandlers(app))
+    const TerminateSignalNotifier terminate({ SIGTERM, SIGINT });
+    if (!terminate.isValid())
         qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
+    QObject::connect(&terminate, &TerminateSignalNotifier::received, &app, &QCoreApplication::quit);
 
     KestCacheLocalServer server(new KestCacheService);
     const int port = GlobalSetting::instance()->port();

@@ -2,6 +2,7 @@
 #include "dbuskestservice.h"
 #include "kestpaths.h"
 #include "messagehandler.h"
+#include "terminatesignalnotifier.h"
 
 #include <QCoreApplication>
 #include <QDBusConnection>
@@ -10,7 +11,6 @@
 #include <QFile>
 #include <QSharedMemory>
 #include <QSharedPointer>
-#include <QSocketNotifier>
 #include <QTimer>
 
 #include <csignal>
@@ -26,7 +26,6 @@ const QString kObjectPath = QStringLiteral("/com/nimbal/kest/iam");
 
 // Process-global: the terminate path releases it outside main.
 QSharedPointer<QSharedMemory> g_instanceGuard;
-int g_signalPipe[2] = { -1, -1 };
 int g_terminatingSignal = 0;
 
 void releaseInstanceGuard()
@@ -35,14 +34,6 @@ void releaseInstanceGuard()
         return;
     g_instanceGuard->detach();
     g_instanceGuard.reset();
-}
-
-void onTerminateSignal(int signalNumber)
-{
-    const char number = char(signalNumber);
-    // Only async-signal-safe work here. Logging, releasing the guard and leaving happen on the event loop:
-    // leaving from inside the handler can deadlock against the bus thread on a lock the interrupted code holds.
-    [[maybe_unused]] const ssize_t written = ::write(g_signalPipe[1], &number, 1);
 }
 
 void leaveOnSignal(int signalNumber)
@@ -55,19 +46,11 @@ void leaveOnSignal(int signalNumber)
 
 void installTerminateHandler(QCoreApplication &app)
 {
-    if (::pipe2(g_signalPipe, O_CLOEXEC | O_NONBLOCK) != 0) {
-        qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
-        return;
-    }
-    auto *notifier = new QSocketNotifier(g_signalPipe[0], QSocketNotifier::Read, &app);
-    QObject::connect(notifier, &QSocketNotifier::activated, &app, []() {
-        char number = 0;
-        if (::read(g_signalPipe[0], &number, 1) == 1)
-            leaveOnSignal(number);
-    });
     // SIGKILL cannot be caught; the request is kept all the same.
-    for (const int signalNumber : { SIGTERM, SIGKILL, SIGQUIT, SIGINT })
-        std::signal(signalNumber, onTerminateSignal);
+    auto *notifier = new TerminateSignalNotifier({ SIGTERM, SIGKILL, SIGQUIT, SIGINT }, &app);
+    if (!notifier->isValid())
+        qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
+    QObject::connect(notifier, &TerminateSignalNotifier::received, &app, leaveOnSignal);
 }
 
 // 0 once this process holds the guard, else the exit code.
