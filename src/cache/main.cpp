@@ -108,6 +108,9 @@ int main(int argc, char *argv[])
     QCoreApplication app(argc, argv);
     QCoreApplication::setApplicationName(QStringLiteral("cache-kest"));
     QCoreApplication::setApplicationVersion(QStringLiteral("1.0"));
+    // No Qt plugins: the network bearer plugins would connect to the system bus at the first request,
+    // and a stalled bus would then stall every login behind it.
+    QCoreApplication::setLibraryPaths(QStringList());
     if (QCoreApplication::arguments().size() <= 1)
         return runDaemon(app);
 
