@@ -2,40 +2,29 @@
 
 #include <QFile>
 
-namespace {
+namespace
+{
 const char addressVariable[] = "DBUS_SYSTEM_BUS_ADDRESS";
-const int startTimeoutMs = 10000;
 
 QByteArray policyBlock(PrivateBus::Policy policy)
 {
     if (policy == PrivateBus::Policy::Open)
-        return "  <policy context=\"default\">\n"
-               "    <allow user=\"*\"/>\n"
-               "    <allow own=\"*\"/>\n"
-               "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
-               "    <allow receive_sender=\"*\"/>\n"
-               "  </policy>\n";
-    return "  <policy context=\"default\">\n"
-           "    <allow user=\"*\"/>\n"
-           "    <deny own=\"*\"/>\n"
-           "    <deny send_type=\"method_call\"/>\n"
-           "    <allow send_type=\"signal\"/>\n"
-           "    <allow send_requested_reply=\"true\" send_type=\"method_return\"/>\n"
-           "    <allow send_requested_reply=\"true\" send_type=\"error\"/>\n"
-           "    <allow receive_type=\"method_call\"/>\n"
-           "    <allow receive_type=\"method_return\"/>\n"
-           "    <allow receive_type=\"error\"/>\n"
-           "    <allow receive_type=\"signal\"/>\n"
-           "    <allow send_destination=\"org.freedesktop.DBus\" send_interface=\"org.freedesktop.DBus\"/>\n"
-           "    <allow send_destination=\"org.freedesktop.DBus\" send_interface=\"org.freedesktop.DBus.Introspectable\"/>\n"
-           "    <allow send_destination=\"org.freedesktop.DBus\" send_interface=\"org.freedesktop.DBus.Properties\"/>\n"
-           "  </policy>\n"
-           "  <policy user=\"root\">\n"
-           "    <allow own=\"*\"/>\n"
-           "    <allow send_type=\"method_call\" send_destination=\"org.freedesktop.login1\"/>\n"
-           "    <allow send_type=\"method_call\" send_destination=\"com.nimbal.daemon.Accounts\"/>\n"
-           "    <allow send_type=\"method_call\" send_destination=\"com.nimbal.ose.LockService\"/>\n"
-           "  </policy>\n";
+        return "<policy context=\"default\"><allow user=\"*\"/><allow own=\"*\"/>\n"
+               "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow receive_sender=\"*\"/></policy>\n";
+    // Replies and signals pass; method calls only where a policy allows them, as on the machine's bus.
+    QByteArray text = "<policy context=\"default\"><allow user=\"*\"/><deny own=\"*\"/>\n"
+                      "<deny send_type=\"method_call\"/><allow send_type=\"signal\"/>\n"
+                      "<allow send_requested_reply=\"true\" send_type=\"method_return\"/>\n"
+                      "<allow send_requested_reply=\"true\" send_type=\"error\"/>\n";
+    for (const char *type : { "method_call", "method_return", "error", "signal" })
+        text += QByteArray("<allow receive_type=\"") + type + "\"/>\n";
+    for (const char *interface : { "", ".Introspectable", ".Properties" })
+        text += QByteArray("<allow send_destination=\"org.freedesktop.DBus\" send_interface=\"org.freedesktop.DBus")
+            + interface + "\"/>\n";
+    text += "</policy>\n<policy user=\"root\"><allow own=\"*\"/>\n";
+    for (const char *peer : { "org.freedesktop.login1", "com.nimbal.daemon.Accounts", "com.nimbal.ose.LockService" })
+        text += QByteArray("<allow send_type=\"method_call\" send_destination=\"") + peer + "\"/>\n";
+    return text + "</policy>\n";
 }
 } // namespace
 
@@ -43,28 +32,27 @@ PrivateBus::PrivateBus(Policy policy, const QStringList &policyFiles)
     : m_previousAddress(qgetenv(addressVariable))
     , m_hadPreviousAddress(qEnvironmentVariableIsSet(addressVariable))
 {
-    if (!m_dir.isValid()) {
-        m_error = QStringLiteral("cannot create a temporary directory");
+    QByteArray config = "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
+                        " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+                        "<busconfig><type>system</type><auth>EXTERNAL</auth>\n<listen>unix:path="
+        + QFile::encodeName(m_dir.filePath(QStringLiteral("system_bus_socket"))) + "</listen>\n" + policyBlock(policy);
+    for (const QString &file : policyFiles)
+        config += "<include>" + QFile::encodeName(file) + "</include>\n";
+    config += "</busconfig>\n";
+    QFile configFile(m_dir.filePath(QStringLiteral("bus.conf")));
+    if (!m_dir.isValid() || !configFile.open(QIODevice::WriteOnly) || configFile.write(config) != config.size()) {
+        m_error = QStringLiteral("cannot write the bus configuration in ") + m_dir.path();
         return;
     }
-    const QString config = m_dir.filePath(QStringLiteral("bus.conf"));
-    if (!writeConfig(policy, policyFiles, config)) {
-        m_error = QStringLiteral("cannot write ") + config;
-        return;
-    }
-    m_daemon.setProgram(QStringLiteral("dbus-daemon"));
-    m_daemon.setArguments({ QStringLiteral("--config-file=") + config, QStringLiteral("--nofork"),
-                            QStringLiteral("--nopidfile"), QStringLiteral("--print-address=1") });
+    configFile.close();
     m_daemon.setProcessChannelMode(QProcess::ForwardedErrorChannel);
-    m_daemon.start();
-    if (!m_daemon.waitForStarted(startTimeoutMs)) {
-        m_error = QStringLiteral("dbus-daemon did not start: ") + m_daemon.errorString();
-        return;
-    }
-    while (!m_daemon.canReadLine() && m_daemon.waitForReadyRead(startTimeoutMs)) { }
+    m_daemon.start(QStringLiteral("dbus-daemon"),
+        { QStringLiteral("--config-file=") + configFile.fileName(), QStringLiteral("--nofork"),
+            QStringLiteral("--nopidfile"), QStringLiteral("--print-address=1") });
+    while (!m_daemon.canReadLine() && m_daemon.waitForReadyRead(10000)) { }
     m_address = QString::fromUtf8(m_daemon.readLine()).trimmed();
     if (m_address.isEmpty()) {
-        m_error = QStringLiteral("dbus-daemon printed no address");
+        m_error = QStringLiteral("dbus-daemon printed no address: ") + m_daemon.errorString();
         return;
     }
     qputenv(addressVariable, m_address.toUtf8());
@@ -92,8 +80,9 @@ bool PrivateBus::isRunning() const
 bool PrivateBus::openToOtherUsers()
 {
     // Traverse only: others reach the socket by name but cannot list or change the directory.
-    return QFile::setPermissions(m_dir.path(), QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner
-                                     | QFileDevice::ExeGroup | QFileDevice::ExeOther);
+    return QFile::setPermissions(m_dir.path(),
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner | QFileDevice::ExeGroup
+            | QFileDevice::ExeOther);
 }
 
 QString PrivateBus::address() const
@@ -104,23 +93,4 @@ QString PrivateBus::address() const
 QString PrivateBus::errorText() const
 {
     return m_error;
-}
-
-bool PrivateBus::writeConfig(Policy policy, const QStringList &policyFiles, const QString &path) const
-{
-    QByteArray text = "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
-                      " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
-                      "<busconfig>\n"
-                      "  <type>system</type>\n"
-                      "  <listen>unix:path="
-        + QFile::encodeName(m_dir.filePath(QStringLiteral("system_bus_socket")))
-        + "</listen>\n"
-          "  <auth>EXTERNAL</auth>\n"
-        + policyBlock(policy);
-    for (const QString &file : policyFiles)
-        text += "  <include>" + QFile::encodeName(file) + "</include>\n";
-    text += "</busconfig>\n";
-
-    QFile file(path);
-    return file.open(QIODevice::WriteOnly) && file.write(text) == text.size();
 }

@@ -26,8 +26,6 @@ public:
     QString errorText() const;
 
 private:
-    bool writeConfig(Policy policy, const QStringList &policyFiles, const QString &path) const;
-
     QTemporaryDir m_dir;
     QProcess m_daemon;
     QString m_address;
