@@ -8,68 +8,59 @@
 #include <QTemporaryDir>
 #include <QVariantMap>
 
-// The test domain server (tools/test-domain-server) run as a child process on 127.0.0.2, with
-// certificates made for this fixture alone. It owns a temporary directory holding the certificates,
-// the users file, the behaviour file and the request log; the server is stopped on destruction.
-//
-//   DomainServerFixture server;            // certificates and defaultData() in place
-//   QVERIFY2(server.start(), qPrintable(server.errorText()));
-//   root.writeSettings(server.settingsIni({ { "main/enable", "true" } }));
-//   ... server.requests() lists what the server received, oldest first.
+// The test domain server (tools/test-domain-server) as a child process on 127.0.0.2, with certificates,
+// data, behaviour and request log of its own in a temporary directory; stopped on destruction.
 class DomainServerFixture
 {
 public:
     DomainServerFixture();
-    ~DomainServerFixture();
+    ~DomainServerFixture() { stop(); }
     DomainServerFixture(const DomainServerFixture &) = delete;
     DomainServerFixture &operator=(const DomainServerFixture &) = delete;
 
     // False when the certificates could not be made; errorText() says why.
-    bool isValid() const;
-    QString errorText() const;
+    bool isValid() const { return m_valid; }
+    QString errorText() const { return m_error; }
 
-    static QString address();
-    // alice (10001, "alice-password") and bob (10002, "bob-password") in group kest (10000),
+    static QString address() { return QStringLiteral("127.0.0.2"); }
+    // alice (10001, "alice-password", sudo) and bob (10002, "bob-password") in group kest (10000),
     // a group "staff" (10010) with alice, and the domain "kest.test".
     static QJsonObject defaultData();
-    // Runs tools/make-test-certs.sh: ca.pem, server.pem/.key, client.pem/.key in directory.
+    // ca.pem, server.pem/.key and client.pem/.key in directory.
     static bool makeCertificates(const QString &directory, QString *error = nullptr);
 
     // Port 0 lets the server pick a free one; port() tells which.
     bool start(quint16 port = 0);
-    // Stops and starts again on the same port (with the current data, behaviour and mode).
-    bool restart();
+    // Stops and starts again on the same port.
+    bool restart() { return start(m_port); }
     void stop();
-    bool isRunning() const;
-    quint16 port() const;
+    bool isRunning() const { return m_server.state() == QProcess::Running; }
+    quint16 port() const { return m_port; }
     // Plain HTTP instead of HTTPS from the next start on.
-    void setPlainHttp(bool plain);
+    void setPlainHttp(bool plain) { m_plain = plain; }
 
-    QString directory() const;
-    QString caFile() const;
-    QString clientCertificateFile() const;
-    QString clientKeyFile() const;
-    QString dataFile() const;
+    QString caFile() const { return m_dir.filePath(QStringLiteral("ca.pem")); }
+    QString clientCertificateFile() const { return m_dir.filePath(QStringLiteral("client.pem")); }
+    QString clientKeyFile() const { return m_dir.filePath(QStringLiteral("client.key")); }
+    QString dataFile() const { return m_dir.filePath(QStringLiteral("data.json")); }
 
-    bool setData(const QJsonObject &data);
-    QJsonObject data() const;
-    // Takes effect at the server's next request. An empty behaviour removes the path's entry.
+    bool setData(const QJsonObject &data) { return writeJson(QStringLiteral("data.json"), data); }
+    QJsonObject data() const { return readJson(QStringLiteral("data.json")); }
+    // Takes effect at the server's next request; an empty behaviour removes the path's entry.
     bool setMisbehaviour(const QString &path, const QString &behaviour);
-    bool clearMisbehaviour();
+    bool clearMisbehaviour() { return writeJson(QStringLiteral("behaviour.json"), QJsonObject()); }
 
+    // What the server received, oldest first.
     QList<QJsonObject> requests() const;
     bool clearRequests();
 
-    // Settings file text that points the client at this server: ip, port, "network-timeout" 5 and
-    // the client's certificate files. Overrides are "group/key" to a value; an invalid QVariant
-    // removes the key.
+    // Settings that point the client at this server with its certificate files and "network-timeout" 5.
+    // Overrides are "group/key" to a value; an invalid QVariant removes the key.
     QByteArray settingsIni(const QVariantMap &overrides = QVariantMap()) const;
 
 private:
-    QString filePath(const QString &name) const;
     bool writeJson(const QString &name, const QJsonObject &object) const;
     QJsonObject readJson(const QString &name) const;
-    bool waitForListening();
 
     QTemporaryDir m_dir;
     QProcess m_server;
