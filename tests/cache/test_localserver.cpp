@@ -1,5 +1,5 @@
 #include "cachedaemonfixture.h"
-#include "localservertestsupport.h"
+#include "rawconnection.h"
 #include "testroot.h"
 
 #include <QRandomGenerator>

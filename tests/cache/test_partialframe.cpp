@@ -1,5 +1,5 @@
 #include "cachedaemonfixture.h"
-#include "localservertestsupport.h"
+#include "rawconnection.h"
 #include "testroot.h"
 
 #include <QTest>
@@ -27,7 +27,7 @@ private Q_SLOTS:
         // A connection that holds no bytes at all is not a partial frame.
         QVERIFY(idle.isConnected());
         QCOMPARE(daemon.call(QStringLiteral("queryGid"), { QStringLiteral("1"), QStringLiteral("{}") }),
-                 QByteArray(R"({"pass":false})"));
+            QByteArray(R"({"pass":false})"));
     }
 };
 

@@ -1,11 +1,12 @@
 #include "cachedaemonfixture.h"
 
+#include "rawconnection.h"
+
 #include <QElapsedTimer>
 #include <QFile>
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
-#include <QTcpSocket>
 #include <QThread>
 #include <QtEndian>
 
@@ -18,25 +19,6 @@ QString pidFile()
     return QString::fromLocal8Bit(qgetenv("KEST_IAM_ROOT")) + QStringLiteral("/run/cache-kest.pid");
 }
 
-// Reads whole reply frames from the socket; the payload of the first one.
-QByteArray readFrame(QTcpSocket &socket, int timeoutMs)
-{
-    QElapsedTimer timer;
-    timer.start();
-    QByteArray buffer;
-    while (timer.elapsed() < timeoutMs) {
-        buffer += socket.readAll();
-        if (buffer.size() >= 4) {
-            const quint32 length = qFromBigEndian<quint32>(buffer.constData());
-            if (quint32(buffer.size()) >= length + 4)
-                return buffer.mid(4, int(length));
-        }
-        if (!socket.waitForReadyRead(int(qMax<qint64>(1, timeoutMs - timer.elapsed())))
-            && socket.state() != QAbstractSocket::ConnectedState)
-            break;
-    }
-    return QByteArray();
-}
 } // namespace
 
 CacheDaemonFixture::~CacheDaemonFixture()
@@ -125,13 +107,9 @@ QString CacheDaemonFixture::errorText() const
 
 QByteArray CacheDaemonFixture::request(const QByteArray &payload, int timeoutMs) const
 {
-    QTcpSocket socket;
-    socket.connectToHost(QStringLiteral("127.0.0.1"), m_port);
-    if (!socket.waitForConnected(5000))
-        return QByteArray();
-    socket.write(frame(payload));
-    socket.flush();
-    return readFrame(socket, timeoutMs);
+    RawConnection connection(m_port);
+    connection.send(frame(payload));
+    return connection.reply(timeoutMs);
 }
 
 QByteArray CacheDaemonFixture::call(const QString &name, const QStringList &argv) const
