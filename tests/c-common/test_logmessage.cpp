@@ -4,39 +4,33 @@
 #include <QTemporaryFile>
 #include <QTest>
 
+#include <functional>
 #include <unistd.h>
 
 namespace
 {
-// Collects what one stream receives while it lives.
-class StreamCapture
+// Runs what with stderr and stdout sent to files; returns what each of the two received.
+QByteArrayList streamed(const std::function<void()> &what)
 {
-public:
-    explicit StreamCapture(FILE *stream)
-        : m_stream(stream)
-        , m_saved(dup(fileno(stream)))
-    {
-        m_file.open();
-        dup2(m_file.handle(), fileno(stream));
+    FILE *const streams[] = { stderr, stdout };
+    QTemporaryFile files[2];
+    int saved[2];
+    for (int i = 0; i < 2; ++i) {
+        files[i].open();
+        saved[i] = dup(fileno(streams[i]));
+        dup2(files[i].handle(), fileno(streams[i]));
     }
-    ~StreamCapture() { text(); }
-    QByteArray text()
-    {
-        if (m_saved >= 0) {
-            fflush(m_stream);
-            dup2(m_saved, fileno(m_stream));
-            close(m_saved);
-            m_saved = -1;
-        }
-        m_file.seek(0);
-        return m_file.readAll();
+    what();
+    QByteArrayList texts;
+    for (int i = 0; i < 2; ++i) {
+        fflush(streams[i]);
+        dup2(saved[i], fileno(streams[i]));
+        close(saved[i]);
+        files[i].seek(0);
+        texts << files[i].readAll();
     }
-
-private:
-    FILE *m_stream;
-    int m_saved;
-    QTemporaryFile m_file;
-};
+    return texts;
+}
 
 void setEnv(const char *name, const QByteArray &value)
 {
@@ -72,10 +66,8 @@ private Q_SLOTS:
         QFETCH(QByteArray, user);
         QFETCH(QByteArray, tail);
         setEnv("USER", user);
-        StreamCapture error(stderr);
-        log_message(3, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure");
-        const QByteArray streamed = error.text();
-
+        const QByteArrayList streams
+            = streamed([] { log_message(3, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure"); });
         const QList<SyslogLine> lines = SyslogCapture::lines();
         QCOMPARE(lines.size(), 1);
         QCOMPARE(lines.first().priority, 3);
@@ -84,40 +76,33 @@ private Q_SLOTS:
                      .exactMatch(QString::fromLatin1(line.left(19))),
             line);
         QCOMPARE(line.mid(19), " process: test_logmessage(" + QByteArray::number(getpid()) + "), " + tail);
-        QCOMPARE(streamed, line + '\n');
+        QCOMPARE(streams, QByteArrayList({ line + '\n', QByteArray() }));
     }
 
     void levels_data()
     {
         QTest::addColumn<int>("level");
         QTest::addColumn<QByteArray>("logLevel");
-        QTest::addColumn<bool>("toSyslog");
-        QTest::addColumn<bool>("toStderr");
-        QTest::addColumn<bool>("toStdout");
-        QTest::newRow("warning") << 4 << QByteArray() << true << true << false;
-        QTest::newRow("notice") << 5 << QByteArray() << true << false << false;
-        QTest::newRow("debug") << 7 << QByteArray() << true << false << false;
-        QTest::newRow("trace, variable unset") << 9 << QByteArray() << false << false << false;
-        QTest::newRow("trace, variable empty") << 8 << QByteArray("") << false << false << false;
-        QTest::newRow("trace, variable 0") << 9 << QByteArray("0") << true << false << true;
+        QTest::addColumn<QByteArray>("sinks");
+        QTest::newRow("warning") << 4 << QByteArray() << QByteArray("syslog stderr");
+        QTest::newRow("notice") << 5 << QByteArray() << QByteArray("syslog");
+        QTest::newRow("trace, variable unset") << 9 << QByteArray() << QByteArray();
+        QTest::newRow("trace, variable empty") << 8 << QByteArray("") << QByteArray();
+        QTest::newRow("trace, variable 0") << 9 << QByteArray("0") << QByteArray("syslog stdout");
     }
 
     void levels()
     {
         QFETCH(int, level);
         QFETCH(QByteArray, logLevel);
-        QFETCH(bool, toSyslog);
-        QFETCH(bool, toStderr);
-        QFETCH(bool, toStdout);
+        QFETCH(QByteArray, sinks);
         setEnv("KEST_IAM_LOGLEVEL", logLevel);
-        StreamCapture error(stderr);
-        StreamCapture output(stdout);
-        log_message(level, "file", 1, "function", "level test");
-        QCOMPARE(error.text().contains("level test"), toStderr);
-        QCOMPARE(output.text().contains("level test"), toStdout);
+        const QByteArrayList streams = streamed([level] { log_message(level, "file", 1, "function", "level test"); });
         qunsetenv("KEST_IAM_LOGLEVEL");
-        QCOMPARE(SyslogCapture::count("level test"), toSyslog ? 1 : 0);
-        if (toSyslog)
+        QCOMPARE(streams.first().contains("level test"), sinks.contains("stderr"));
+        QCOMPARE(streams.last().contains("level test"), sinks.contains("stdout"));
+        QCOMPARE(SyslogCapture::count("level test"), sinks.contains("syslog") ? 1 : 0);
+        if (sinks.contains("syslog"))
             QCOMPARE(SyslogCapture::lines().first().priority, level);
     }
 

@@ -15,15 +15,7 @@ trap cleanup EXIT
 passed=0
 failed=0
 check() {
-    local name=$1
-    shift
-    if "$@"; then
-        passed=$((passed + 1))
-        echo "PASS: $name"
-    else
-        failed=$((failed + 1))
-        echo "FAIL: $name"
-    fi
+    if "${@:2}"; then passed=$((passed + 1)) && echo "PASS: $1"; else failed=$((failed + 1)) && echo "FAIL: $1"; fi
 }
 
 cpack --config "$build/CPackConfig.cmake" -B "$work/out" >"$work/cpack.log" 2>&1 || { cat "$work/cpack.log"; exit 1; }
@@ -33,21 +25,11 @@ multiarch=$(gcc -print-multiarch)
 check "package file name" test "$(basename "$deb")" = "kest-iam_1.0.0_${arch}.deb"
 
 dpkg-deb -c "$deb" | awk '{print $6}' | sed -e 's|^\./|/|' -e 's|/$||' | grep -v '^$' >"$work/files"
-expected=(
-    /etc/kest-iam.conf
-    /usr/bin/cache-kest
-    /usr/sbin/dbus-kest
-    /usr/include/kest-iam/common.h
-    /usr/include/kest-iam/cache-common.h
-    /usr/include/kest-iam/paths.h
-    "/usr/lib/$multiarch/libkest-iam.so"
-    "/usr/lib/$multiarch/libkest-iam.so.1"
-    "/usr/lib/$multiarch/pkgconfig/kest-iam.pc"
-    /usr/lib/systemd/system/cache-kest.service
-    /usr/lib/systemd/system/dbus-kest.service
-    /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service
-    /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf
-    /usr/share/kest
+expected=(/etc/kest-iam.conf /usr/bin/cache-kest /usr/sbin/dbus-kest /usr/share/kest
+    /usr/include/kest-iam/{common,cache-common,paths}.h "/usr/lib/$multiarch/libkest-iam.so"
+    "/usr/lib/$multiarch/libkest-iam.so.1" "/usr/lib/$multiarch/pkgconfig/kest-iam.pc"
+    /usr/lib/systemd/system/{cache-kest,dbus-kest}.service
+    /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf
 )
 for file in "${expected[@]}"; do
     check "package holds $file" grep -qx -- "$file" "$work/files"
@@ -84,38 +66,26 @@ check "activation file names the unit" grep -qx "SystemdService=dbus-kest.servic
 if command -v systemd-analyze >/dev/null; then
     # Point the units at the unpacked programs so that systemd can check them here.
     mkdir -p "$work/units"
-    for unit in cache-kest.service dbus-kest.service; do
-        sed "s|^ExecStart=|ExecStart=$work/root|" "$work/root/usr/lib/systemd/system/$unit" >"$work/units/$unit"
+    for unit in cache-kest dbus-kest; do
+        sed "s|^ExecStart=|ExecStart=$work/root|" "$work/root/usr/lib/systemd/system/$unit.service" >"$work/units/$unit.service"
     done
     verify_units() {
-        systemd-analyze verify "$work/units/cache-kest.service" "$work/units/dbus-kest.service" >"$work/verify.log" 2>&1 \
-            && ! grep -q . "$work/verify.log" || { cat "$work/verify.log"; return 1; }
+        systemd-analyze verify "$work"/units/*.service >"$work/verify.log" 2>&1 && ! grep -q . "$work/verify.log" \
+            || { cat "$work/verify.log"; return 1; }
     }
     check "systemd accepts the units" verify_units
 else
     echo "SKIP: systemd-analyze is not installed"
 fi
 
-cat >"$work/bus.conf" <<CONF
-<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN"
- "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">
-<busconfig>
-  <type>system</type>
-  <listen>unix:path=$work/bus_socket</listen>
-  <auth>EXTERNAL</auth>
-  <include>$work/root/usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf</include>
-</busconfig>
-CONF
+printf '%s\n' '<busconfig><type>system</type><auth>EXTERNAL</auth>' "<listen>unix:path=$work/bus_socket</listen>" \
+    "<include>$work/root/usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf</include></busconfig>" >"$work/bus.conf"
+# With --fork, dbus-daemon exits only once the bus is up, or fails on a policy it cannot load.
 policy_loads() {
-    dbus-daemon --config-file="$work/bus.conf" --nofork --nopidfile --print-address=1 >"$work/address" 2>"$work/bus.log" &
-    daemon_pid=$!
-    for _ in $(seq 50); do
-        grep -q unix: "$work/address" && kill -0 "$daemon_pid" 2>/dev/null && return 0
-        kill -0 "$daemon_pid" 2>/dev/null || break
-        sleep 0.1
-    done
-    cat "$work/bus.log"
-    return 1
+    local out
+    out=$(dbus-daemon --config-file="$work/bus.conf" --fork --nopidfile --print-pid=1 --print-address=1) || return 1
+    daemon_pid=$(grep -x '[0-9]*' <<<"$out")
+    grep -q '^unix:' <<<"$out"
 }
 check "dbus-daemon loads the policy file" policy_loads
 

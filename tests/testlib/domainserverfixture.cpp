@@ -7,8 +7,6 @@
 
 namespace
 {
-const int waitMs = 15000;
-
 QString buildPath(const QString &name)
 {
     return qEnvironmentVariable("KEST_TEST_BINARY_DIR") + QStringLiteral("/tools/test-domain-server/") + name;
@@ -47,23 +45,22 @@ bool DomainServerFixture::makeCertificates(const QString &directory, QString *er
     return false;
 }
 
-bool DomainServerFixture::start(quint16 port)
+bool DomainServerFixture::start(quint16 port, bool plain)
 {
     stop();
     QStringList arguments { QStringLiteral("--address"), address(), QStringLiteral("--port"), QString::number(port),
-        QStringLiteral("--data"), dataFile(), QStringLiteral("--behaviour"),
-        m_dir.filePath(QStringLiteral("behaviour.json")), QStringLiteral("--log"),
-        m_dir.filePath(QStringLiteral("requests.log")) };
-    if (m_plain)
+        QStringLiteral("--data"), pathOf("data.json"), QStringLiteral("--behaviour"), pathOf("behaviour.json"),
+        QStringLiteral("--log"), pathOf("requests.log") };
+    if (plain)
         arguments << QStringLiteral("--plain");
     else
-        arguments << QStringLiteral("--cert") << m_dir.filePath(QStringLiteral("server.pem")) << QStringLiteral("--key")
-                  << m_dir.filePath(QStringLiteral("server.key")) << QStringLiteral("--ca") << caFile();
+        arguments << QStringLiteral("--cert") << pathOf("server.pem") << QStringLiteral("--key") << pathOf("server.key")
+                  << QStringLiteral("--ca") << pathOf("ca.pem");
     m_server.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_server.start(buildPath(QStringLiteral("kest-test-domain-server")), arguments);
     // The server's one line on standard output names the port it listens on.
     const QByteArray prefix = "listening on " + address().toLatin1() + ':';
-    const QDeadlineTimer deadline(waitMs);
+    const QDeadlineTimer deadline(15000);
     while (!m_server.canReadLine() && m_server.waitForReadyRead(static_cast<int>(deadline.remainingTime()))) { }
     const QByteArray line = m_server.readLine().trimmed();
     if (line.startsWith(prefix)) {
@@ -88,7 +85,9 @@ void DomainServerFixture::stop()
 
 bool DomainServerFixture::setMisbehaviour(const QString &path, const QString &behaviour)
 {
-    QJsonObject paths = readJson(QStringLiteral("behaviour.json"));
+    QFile file(pathOf("behaviour.json"));
+    QJsonObject paths
+        = file.open(QIODevice::ReadOnly) ? QJsonDocument::fromJson(file.readAll()).object() : QJsonObject();
     if (behaviour.isEmpty())
         paths.remove(path);
     else
@@ -99,7 +98,7 @@ bool DomainServerFixture::setMisbehaviour(const QString &path, const QString &be
 QList<QJsonObject> DomainServerFixture::requests() const
 {
     QList<QJsonObject> result;
-    QFile file(m_dir.filePath(QStringLiteral("requests.log")));
+    QFile file(pathOf("requests.log"));
     if (!file.open(QIODevice::ReadOnly))
         return result;
     while (!file.atEnd()) {
@@ -112,16 +111,16 @@ QList<QJsonObject> DomainServerFixture::requests() const
 
 bool DomainServerFixture::clearRequests()
 {
-    QFile file(m_dir.filePath(QStringLiteral("requests.log")));
+    QFile file(pathOf("requests.log"));
     return !file.exists() || file.resize(0);
 }
 
 QByteArray DomainServerFixture::settingsIni(const QVariantMap &overrides) const
 {
     QMap<QString, QVariant> values { { QStringLiteral("main/ip"), address() }, { QStringLiteral("main/port"), m_port },
-        { QStringLiteral("main/network-timeout"), 5 }, { QStringLiteral("url/server-cert"), caFile() },
-        { QStringLiteral("url/public-key"), clientCertificateFile() },
-        { QStringLiteral("url/private-key"), clientKeyFile() } };
+        { QStringLiteral("main/network-timeout"), 5 }, { QStringLiteral("url/server-cert"), pathOf("ca.pem") },
+        { QStringLiteral("url/public-key"), pathOf("client.pem") },
+        { QStringLiteral("url/private-key"), pathOf("client.key") } };
     for (auto it = overrides.cbegin(); it != overrides.cend(); ++it) {
         if (it.value().isValid())
             values.insert(it.key(), it.value());
@@ -132,10 +131,8 @@ QByteArray DomainServerFixture::settingsIni(const QVariantMap &overrides) const
     QByteArray ini;
     QString group;
     for (auto it = values.cbegin(); it != values.cend(); ++it) {
-        if (it.key().section(QLatin1Char('/'), 0, 0) != group) {
-            group = it.key().section(QLatin1Char('/'), 0, 0);
-            ini += '[' + group.toUtf8() + "]\n";
-        }
+        if (it.key().section(QLatin1Char('/'), 0, 0) != group)
+            ini += '[' + (group = it.key().section(QLatin1Char('/'), 0, 0)).toUtf8() + "]\n";
         ini += it.key().section(QLatin1Char('/'), 1).toUtf8() + '=' + it.value().toString().toUtf8() + '\n';
     }
     return ini;
@@ -146,10 +143,4 @@ bool DomainServerFixture::writeJson(const QString &name, const QJsonObject &obje
     QFile file(m_dir.filePath(name));
     const QByteArray text = QJsonDocument(object).toJson();
     return file.open(QIODevice::WriteOnly | QIODevice::Truncate) && file.write(text) == text.size();
-}
-
-QJsonObject DomainServerFixture::readJson(const QString &name) const
-{
-    QFile file(m_dir.filePath(name));
-    return file.open(QIODevice::ReadOnly) ? QJsonDocument::fromJson(file.readAll()).object() : QJsonObject();
 }

@@ -29,23 +29,12 @@ public:
     // ca.pem, server.pem/.key and client.pem/.key in directory.
     static bool makeCertificates(const QString &directory, QString *error = nullptr);
 
-    // Port 0 lets the server pick a free one; port() tells which.
-    bool start(quint16 port = 0);
-    // Stops and starts again on the same port.
-    bool restart() { return start(m_port); }
+    // Port 0 lets the server pick a free one; port() tells which. plain: HTTP instead of HTTPS.
+    bool start(quint16 port = 0, bool plain = false);
     void stop();
-    bool isRunning() const { return m_server.state() == QProcess::Running; }
     quint16 port() const { return m_port; }
-    // Plain HTTP instead of HTTPS from the next start on.
-    void setPlainHttp(bool plain) { m_plain = plain; }
-
-    QString caFile() const { return m_dir.filePath(QStringLiteral("ca.pem")); }
-    QString clientCertificateFile() const { return m_dir.filePath(QStringLiteral("client.pem")); }
-    QString clientKeyFile() const { return m_dir.filePath(QStringLiteral("client.key")); }
-    QString dataFile() const { return m_dir.filePath(QStringLiteral("data.json")); }
 
     bool setData(const QJsonObject &data) { return writeJson(QStringLiteral("data.json"), data); }
-    QJsonObject data() const { return readJson(QStringLiteral("data.json")); }
     // Takes effect at the server's next request; an empty behaviour removes the path's entry.
     bool setMisbehaviour(const QString &path, const QString &behaviour);
     bool clearMisbehaviour() { return writeJson(QStringLiteral("behaviour.json"), QJsonObject()); }
@@ -59,13 +48,12 @@ public:
     QByteArray settingsIni(const QVariantMap &overrides = QVariantMap()) const;
 
 private:
+    QString pathOf(const char *name) const { return m_dir.filePath(QLatin1String(name)); }
     bool writeJson(const QString &name, const QJsonObject &object) const;
-    QJsonObject readJson(const QString &name) const;
 
     QTemporaryDir m_dir;
     QProcess m_server;
     QString m_error;
     quint16 m_port = 0;
-    bool m_plain = false;
     bool m_valid = false;
 };

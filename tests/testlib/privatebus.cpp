@@ -60,21 +60,11 @@ PrivateBus::PrivateBus(Policy policy, const QStringList &policyFiles)
 
 PrivateBus::~PrivateBus()
 {
-    if (m_daemon.state() != QProcess::NotRunning) {
-        m_daemon.terminate();
-        if (!m_daemon.waitForFinished(5000))
-            m_daemon.kill();
-        m_daemon.waitForFinished(5000);
-    }
-    if (m_hadPreviousAddress)
-        qputenv(addressVariable, m_previousAddress);
-    else
-        qunsetenv(addressVariable);
-}
-
-bool PrivateBus::isRunning() const
-{
-    return !m_address.isEmpty() && m_daemon.state() == QProcess::Running;
+    m_daemon.terminate();
+    if (!m_daemon.waitForFinished(5000))
+        m_daemon.kill();
+    m_daemon.waitForFinished(5000);
+    m_hadPreviousAddress ? qputenv(addressVariable, m_previousAddress) : qunsetenv(addressVariable);
 }
 
 bool PrivateBus::openToOtherUsers()
@@ -83,14 +73,4 @@ bool PrivateBus::openToOtherUsers()
     return QFile::setPermissions(m_dir.path(),
         QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner | QFileDevice::ExeGroup
             | QFileDevice::ExeOther);
-}
-
-QString PrivateBus::address() const
-{
-    return m_address;
-}
-
-QString PrivateBus::errorText() const
-{
-    return m_error;
 }

@@ -19,11 +19,11 @@ public:
     PrivateBus(const PrivateBus &) = delete;
     PrivateBus &operator=(const PrivateBus &) = delete;
 
-    bool isRunning() const;
+    bool isRunning() const { return !m_address.isEmpty() && m_daemon.state() == QProcess::Running; }
     // Lets processes of other users reach the bus socket (its directory is private to root otherwise).
     bool openToOtherUsers();
-    QString address() const;
-    QString errorText() const;
+    QString address() const { return m_address; }
+    QString errorText() const { return m_error; }
 
 private:
     QTemporaryDir m_dir;

@@ -6,45 +6,41 @@
 #include <cstdarg>
 #include <cstdio>
 
-namespace {
+namespace
+{
 QMutex mutex;
 QList<SyslogLine> captured;
+} // namespace
 
-void record(int priority, const char *format, va_list args)
+// Fortified builds call the checking variants (__syslog_chk, __vsyslog_chk).
+extern "C" {
+void vsyslog(int priority, const char *format, va_list args)
 {
     char text[65536];
     vsnprintf(text, sizeof(text), format, args);
     QMutexLocker locker(&mutex);
     captured.append(SyslogLine { priority, QByteArray(text) });
 }
-} // namespace
 
-extern "C" {
+void __vsyslog_chk(int priority, int, const char *format, va_list args)
+{
+    vsyslog(priority, format, args);
+}
+
 void syslog(int priority, const char *format, ...)
 {
     va_list args;
     va_start(args, format);
-    record(priority, format, args);
+    vsyslog(priority, format, args);
     va_end(args);
 }
 
-void vsyslog(int priority, const char *format, va_list args)
-{
-    record(priority, format, args);
-}
-
-// Fortified builds call the checking variants.
 void __syslog_chk(int priority, int, const char *format, ...)
 {
     va_list args;
     va_start(args, format);
-    record(priority, format, args);
+    vsyslog(priority, format, args);
     va_end(args);
-}
-
-void __vsyslog_chk(int priority, int, const char *format, va_list args)
-{
-    record(priority, format, args);
 }
 }
 
@@ -63,15 +59,9 @@ QList<SyslogLine> SyslogCapture::lines()
 QList<SyslogLine> SyslogCapture::matching(const QByteArray &fragment)
 {
     QList<SyslogLine> result;
-    const QList<SyslogLine> all = lines();
-    for (const SyslogLine &line : all) {
+    for (const SyslogLine &line : lines()) {
         if (line.text.contains(fragment))
             result.append(line);
     }
     return result;
-}
-
-int SyslogCapture::count(const QByteArray &fragment)
-{
-    return matching(fragment).size();
 }

@@ -16,5 +16,5 @@ public:
     static QList<SyslogLine> lines();
     // Lines whose text contains the fragment.
     static QList<SyslogLine> matching(const QByteArray &fragment);
-    static int count(const QByteArray &fragment);
+    static int count(const QByteArray &fragment) { return matching(fragment).size(); }
 };

@@ -6,18 +6,18 @@
 #include <QDBusReply>
 #include <QTest>
 
+#include <algorithm>
+
 class Echo : public QObject
 {
     Q_OBJECT
     Q_CLASSINFO("D-Bus Interface", "org.example.Echo")
 
 public Q_SLOTS:
-    QString Reverse(const QString &text)
+    QString Reverse(QString text)
     {
-        QString reversed;
-        for (auto it = text.crbegin(); it != text.crend(); ++it)
-            reversed.append(*it);
-        return reversed;
+        std::reverse(text.begin(), text.end());
+        return text;
     }
 };
 
@@ -41,10 +41,9 @@ private Q_SLOTS:
         QVERIFY(service.registerService(QStringLiteral("org.example.Echo")));
 
         QDBusConnection system = QDBusConnection::systemBus();
-        QVERIFY(system.isConnected());
-        QVERIFY(system.interface()->isServiceRegistered(QStringLiteral("org.example.Echo")));
+        QVERIFY(system.isConnected() && system.interface()->isServiceRegistered(QStringLiteral("org.example.Echo")));
         QDBusMessage call = QDBusMessage::createMethodCall(QStringLiteral("org.example.Echo"), QStringLiteral("/echo"),
-                                                           QStringLiteral("org.example.Echo"), QStringLiteral("Reverse"));
+            QStringLiteral("org.example.Echo"), QStringLiteral("Reverse"));
         call << QStringLiteral("kest");
         QDBusReply<QString> reply = system.call(call, QDBus::BlockWithGui);
         QVERIFY2(reply.isValid(), qPrintable(reply.error().message()));

@@ -2,12 +2,11 @@
 
 #include <QDateTime>
 #include <QDir>
-#include <QFile>
 #include <QFileInfo>
 
-namespace {
+namespace
+{
 const char rootVariable[] = "KEST_IAM_ROOT";
-const char *const systemDirectories[] = { "/etc", "/var/lib/libkest-iam", "/run", "/home", "/usr/share/kest" };
 } // namespace
 
 TestRoot::TestRoot()
@@ -16,37 +15,14 @@ TestRoot::TestRoot()
 {
     if (!m_dir.isValid())
         return;
-    for (const char *directory : systemDirectories)
+    for (const char *directory : { "/etc", "/var/lib/libkest-iam", "/run", "/home", "/usr/share/kest" })
         QDir().mkpath(filePath(QString::fromLatin1(directory)));
     qputenv(rootVariable, QFile::encodeName(m_dir.path()));
 }
 
 TestRoot::~TestRoot()
 {
-    if (m_hadPreviousRoot)
-        qputenv(rootVariable, m_previousRoot);
-    else
-        qunsetenv(rootVariable);
-}
-
-bool TestRoot::isValid() const
-{
-    return m_dir.isValid();
-}
-
-QString TestRoot::path() const
-{
-    return m_dir.path();
-}
-
-QString TestRoot::filePath(const QString &systemPath) const
-{
-    return m_dir.path() + systemPath;
-}
-
-QString TestRoot::workDir() const
-{
-    return filePath(QStringLiteral("/var/lib/libkest-iam"));
+    m_hadPreviousRoot ? qputenv(rootVariable, m_previousRoot) : qunsetenv(rootVariable);
 }
 
 bool TestRoot::writeFile(const QString &systemPath, const QByteArray &content) const
@@ -54,9 +30,8 @@ bool TestRoot::writeFile(const QString &systemPath, const QByteArray &content) c
     const QString target = filePath(systemPath);
     QDir().mkpath(QFileInfo(target).absolutePath());
     QFile file(target);
-    if (!file.open(QIODevice::WriteOnly | QIODevice::Truncate))
-        return false;
-    if (file.write(content) != content.size() || !file.flush())
+    if (!file.open(QIODevice::WriteOnly | QIODevice::Truncate) || file.write(content) != content.size()
+        || !file.flush())
         return false;
     // QSettings keeps a parsed copy while size and time stamp stay the same; rewrites within one
     // millisecond must still be seen, so every write gets a time stamp of its own.
@@ -67,17 +42,5 @@ bool TestRoot::writeFile(const QString &systemPath, const QByteArray &content) c
 QByteArray TestRoot::readFile(const QString &systemPath) const
 {
     QFile file(filePath(systemPath));
-    if (!file.open(QIODevice::ReadOnly))
-        return QByteArray();
-    return file.readAll();
-}
-
-bool TestRoot::writeSettings(const QByteArray &ini) const
-{
-    return writeFile(QStringLiteral("/etc/kest-iam.conf"), ini);
-}
-
-bool TestRoot::removeSettings() const
-{
-    return QFile::remove(filePath(QStringLiteral("/etc/kest-iam.conf")));
+    return file.open(QIODevice::ReadOnly) ? file.readAll() : QByteArray();
 }
