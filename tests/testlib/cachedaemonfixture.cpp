@@ -2,29 +2,12 @@
 
 #include "rawconnection.h"
 
-#include <QElapsedTimer>
 #include <QFile>
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
-#include <QThread>
+#include <QTest>
 #include <QtEndian>
-
-namespace
-{
-const int startTimeoutMs = 15000;
-
-QString pidFile()
-{
-    return QString::fromLocal8Bit(qgetenv("KEST_IAM_ROOT")) + QStringLiteral("/run/cache-kest.pid");
-}
-
-} // namespace
-
-CacheDaemonFixture::~CacheDaemonFixture()
-{
-    stop();
-}
 
 QString CacheDaemonFixture::programPath()
 {
@@ -47,88 +30,36 @@ QByteArray CacheDaemonFixture::functionCall(const QString &name, const QStringLi
 
 bool CacheDaemonFixture::start()
 {
-    QFile::remove(pidFile());
-    m_daemon.setProgram(programPath());
+    QFile pidFile(QString::fromLocal8Bit(qgetenv("KEST_IAM_ROOT")) + QStringLiteral("/run/cache-kest.pid"));
+    pidFile.remove();
     m_daemon.setProcessChannelMode(QProcess::ForwardedChannels);
-    m_daemon.start();
-    if (!m_daemon.waitForStarted(startTimeoutMs)) {
-        m_error = QStringLiteral("cache-kest did not start: ") + m_daemon.errorString();
-        return false;
-    }
-    QElapsedTimer timer;
-    timer.start();
-    while (timer.elapsed() < startTimeoutMs && m_daemon.state() == QProcess::Running) {
-        QFile file(pidFile());
-        if (file.open(QIODevice::ReadOnly)) {
-            const QList<QByteArray> lines = file.readAll().split('\n');
-            if (lines.size() >= 2 && lines.at(0).toLongLong() == m_daemon.processId()) {
-                m_port = quint16(lines.at(1).toUInt());
-                return true;
-            }
-        }
-        QThread::msleep(20);
-    }
+    m_daemon.start(programPath(), QStringList());
+    const auto listening = [&] {
+        const QList<QByteArray> lines
+            = pidFile.open(QIODevice::ReadOnly) ? pidFile.readAll().split('\n') : QList<QByteArray>();
+        pidFile.close();
+        m_port = lines.size() >= 2 && lines.at(0).toLongLong() == m_daemon.processId() ? lines.at(1).toUShort() : 0;
+        return m_port != 0 || !isRunning();
+    };
+    if (m_daemon.waitForStarted(15000) && QTest::qWaitFor(listening, 15000) && m_port != 0)
+        return true;
     m_error = QStringLiteral("cache-kest wrote no pid file; exit code ") + QString::number(m_daemon.exitCode());
     return false;
 }
 
 int CacheDaemonFixture::stop()
 {
-    if (m_daemon.state() == QProcess::NotRunning)
-        return m_daemon.exitCode();
     m_daemon.terminate();
-    if (!m_daemon.waitForFinished(10000)) {
+    if (!m_daemon.waitForFinished(10000) && isRunning()) {
         m_daemon.kill();
         m_daemon.waitForFinished(5000);
-        return -1;
     }
     return m_daemon.exitStatus() == QProcess::NormalExit ? m_daemon.exitCode() : -1;
 }
 
-bool CacheDaemonFixture::isRunning() const
-{
-    return m_daemon.state() == QProcess::Running;
-}
-
-quint16 CacheDaemonFixture::port() const
-{
-    return m_port;
-}
-
-qint64 CacheDaemonFixture::pid() const
-{
-    return m_daemon.processId();
-}
-
-QString CacheDaemonFixture::errorText() const
-{
-    return m_error;
-}
-
-QByteArray CacheDaemonFixture::request(const QByteArray &payload, int timeoutMs) const
+QByteArray CacheDaemonFixture::request(const QByteArray &payload) const
 {
     RawConnection connection(m_port);
     connection.send(frame(payload));
-    return connection.reply(timeoutMs);
-}
-
-QByteArray CacheDaemonFixture::call(const QString &name, const QStringList &argv) const
-{
-    return request(functionCall(name, argv));
-}
-
-int CacheDaemonFixture::runClient(const QStringList &arguments, QByteArray *out, QByteArray *err) const
-{
-    QProcess client;
-    client.start(programPath(), arguments);
-    if (!client.waitForFinished(60000)) {
-        client.kill();
-        client.waitForFinished();
-        return -1;
-    }
-    if (out)
-        *out = client.readAllStandardOutput();
-    if (err)
-        *err = client.readAllStandardError();
-    return client.exitStatus() == QProcess::NormalExit ? client.exitCode() : -1;
+    return connection.reply();
 }

@@ -6,14 +6,11 @@
 #include <QStringList>
 
 // The real cache-kest daemon as a child process in the current test root (KEST_IAM_ROOT), and the
-// ways its clients reach it: framed requests over TCP and the cache-kest command line.
+// ways its clients reach it: framed requests over TCP.
 class CacheDaemonFixture
 {
 public:
-    CacheDaemonFixture() = default;
-    ~CacheDaemonFixture();
-    CacheDaemonFixture(const CacheDaemonFixture &) = delete;
-    CacheDaemonFixture &operator=(const CacheDaemonFixture &) = delete;
+    ~CacheDaemonFixture() { stop(); }
 
     static QString programPath();
     static QByteArray frame(const QByteArray &payload);
@@ -21,18 +18,15 @@ public:
 
     // Starts the daemon and waits until its pid file names the port it listens on.
     bool start();
-    // SIGTERM; returns the exit code, or -1 when it did not end in time.
+    // SIGTERM; returns the exit code, or -1 when it did not end normally in time.
     int stop();
-    bool isRunning() const;
-    quint16 port() const;
-    qint64 pid() const;
-    QString errorText() const;
+    bool isRunning() const { return m_daemon.state() == QProcess::Running; }
+    quint16 port() const { return m_port; }
+    QString errorText() const { return m_error; }
 
     // One request on a new connection; the reply's payload, or a null array when none came in time.
-    QByteArray request(const QByteArray &payload, int timeoutMs = 20000) const;
-    QByteArray call(const QString &name, const QStringList &argv) const;
-    // Runs the cache-kest command line; returns its exit code (-1 when it did not finish).
-    int runClient(const QStringList &arguments, QByteArray *out = nullptr, QByteArray *err = nullptr) const;
+    QByteArray request(const QByteArray &payload) const;
+    QByteArray call(const QString &name, const QStringList &argv) const { return request(functionCall(name, argv)); }
 
 private:
     QProcess m_daemon;

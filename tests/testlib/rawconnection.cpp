@@ -1,6 +1,6 @@
 #include "rawconnection.h"
 
-#include <QElapsedTimer>
+#include <QDeadlineTimer>
 #include <QtEndian>
 
 RawConnection::RawConnection(quint16 port)
@@ -17,25 +17,14 @@ void RawConnection::send(const QByteArray &bytes)
 
 QByteArray RawConnection::reply(int timeoutMs)
 {
-    QElapsedTimer timer;
-    timer.start();
-    for (;;) {
-        m_buffer += m_socket.readAll();
-        const quint32 length = m_buffer.size() >= 4 ? qFromBigEndian<quint32>(m_buffer.constData()) : 0;
-        if (m_buffer.size() >= 4 && quint32(m_buffer.size()) >= length + 4) {
-            const QByteArray payload = m_buffer.mid(4, int(length));
-            m_buffer.remove(0, int(length) + 4);
-            return payload;
-        }
-        const qint64 left = timeoutMs - timer.elapsed();
-        if (left <= 0 || (!m_socket.waitForReadyRead(int(left)) && !isConnected()))
+    const QDeadlineTimer deadline(timeoutMs);
+    const auto length = [this] { return m_buffer.size() < 4 ? -1 : int(qFromBigEndian<quint32>(m_buffer.data())); };
+    for (m_buffer += m_socket.readAll(); length() < 0 || m_buffer.size() < length() + 4;
+         m_buffer += m_socket.readAll()) {
+        if (deadline.hasExpired() || (!m_socket.waitForReadyRead(int(deadline.remainingTime())) && !isConnected()))
             return QByteArray();
     }
-}
-
-bool RawConnection::closedWithin(int timeoutMs)
-{
-    if (isConnected())
-        m_socket.waitForDisconnected(timeoutMs);
-    return !isConnected();
+    const QByteArray payload = m_buffer.mid(4, length());
+    m_buffer.remove(0, length() + 4);
+    return payload;
 }

@@ -15,7 +15,7 @@ public:
     // The next reply's payload; null when none arrives in time.
     QByteArray reply(int timeoutMs = 20000);
     // True when the peer closed the connection in time.
-    bool closedWithin(int timeoutMs);
+    bool closedWithin(int timeoutMs) { return !isConnected() || m_socket.waitForDisconnected(timeoutMs); }
     void abort() { m_socket.abort(); }
 
 private:
