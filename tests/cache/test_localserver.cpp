@@ -53,38 +53,26 @@ private Q_SLOTS:
         m_idle.reset(new RawConnection(m_daemon.port()));
     }
 
-    void replies_data()
-    {
-        QTest::addColumn<QByteArray>("payload");
-        QTest::addColumn<QByteArray>("expected");
-        QTest::newRow("not JSON") << QByteArray("hello") << jsonError;
-        QTest::newRow("JSON array") << QByteArray("[1,2]") << jsonError;
-        QTest::newRow("no version") << QByteArray(R"({"functionName":"queryUid","argv":["1000"]})") << missingField;
-        QTest::newRow("two arguments for queryUid")
-            << QByteArray(R"({"version":1,"functionName":"queryUid","argv":["1000","x"]})")
-            << errorReply("Error in JSON argv array (all array members must be strings) !!!");
-        QTest::newRow("letter case") << QByteArray(R"({"version":1,"functionName":"QueryUid","argv":["1000"]})")
-                                     << errorReply("Function name not defined !!!");
-        QTest::newRow("command wins") << QByteArray(R"({"command":9,"data":{},"functionName":"queryUid","argv":["1"]})")
-                                      << result("invalid command!!!");
-        QTest::newRow("command without data")
-            << QByteArray(R"({"command":1})") << result("The JSON field is missing. command and data are required !!!");
-        QTest::newRow("queryGid never served")
-            << call("queryGid", { QStringLiteral("1000"), QStringLiteral("{}") }) << passFalse;
-    }
-
-    void replies()
-    {
-        QFETCH(QByteArray, payload);
-        QFETCH(QByteArray, expected);
-        QCOMPARE(m_daemon.request(payload), expected);
-    }
-
-    void framing_data()
+    void exchanges_data()
     {
         // Bytes to send, each followed by the reply expected next: noReply within 400 ms, or closed.
         QTest::addColumn<QByteArrayList>("steps");
         const auto frame = &CacheDaemonFixture::frame;
+        const auto row = [frame](const char *name, const char *payload, const QByteArray &reply) {
+            QTest::newRow(name) << QByteArrayList { frame(payload), reply };
+        };
+        row("not JSON", "hello", jsonError);
+        row("JSON array", "[1,2]", jsonError);
+        row("no version", R"({"functionName":"queryUid","argv":["1000"]})", missingField);
+        row("two arguments for queryUid", R"({"version":1,"functionName":"queryUid","argv":["1000","x"]})",
+            errorReply("Error in JSON argv array (all array members must be strings) !!!"));
+        row("letter case", R"({"version":1,"functionName":"QueryUid","argv":["1000"]})",
+            errorReply("Function name not defined !!!"));
+        row("command wins", R"({"command":9,"data":{},"functionName":"queryUid","argv":["1"]})",
+            result("invalid command!!!"));
+        row("command without data", R"({"command":1})",
+            result("The JSON field is missing. command and data are required !!!"));
+        row("queryGid never served", R"({"version":1,"functionName":"queryGid","argv":["1000","{}"]})", passFalse);
         const QByteArray empty = frame("{}");
         QTest::newRow("empty frame waits for more bytes")
             << QByteArrayList { QByteArray(4, '\0'), noReply, empty, jsonError, QByteArray(1, ' '), missingField };
@@ -97,7 +85,7 @@ private Q_SLOTS:
         QTest::newRow("frame of 1 MiB") << QByteArrayList { frame(QByteArray(1024 * 1024, ' ')), jsonError };
     }
 
-    void framing()
+    void exchanges()
     {
         QFETCH(QByteArrayList, steps);
         RawConnection connection(m_daemon.port());
