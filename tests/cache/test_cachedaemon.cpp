@@ -40,11 +40,6 @@ CacheControlPtr loadRecord(uint uid)
     return loadCacheRecord(record) ? record : CacheControlPtr();
 }
 
-QString digest(const char *password)
-{
-    return UserListManager::passwordDigest(QLatin1String(password));
-}
-
 QByteArray command(int number, const QJsonValue &data)
 {
     return QJsonDocument(QJsonObject { { QStringLiteral("command"), number }, { QStringLiteral("data"), data } })
@@ -69,21 +64,22 @@ struct Setup {
         return server.isValid() && server.start() && root.writeSettings(server.settingsIni(settings()))
             && daemon.start();
     }
-    QByteArray lookUp(const char *name) const
+    QByteArray call(const char *function, const char *argument, const char *second = nullptr) const
     {
-        return daemon.call(QStringLiteral("queryAccountName"), { QLatin1String(name) });
+        QStringList argv { QString::fromUtf8(argument) };
+        return daemon.call(QLatin1String(function), second ? argv << QString::fromUtf8(second) : argv);
     }
+    QByteArray lookUp(const char *name) const { return call("queryAccountName", name); }
     QByteArray login(const char *name, const char *password) const
     {
-        return daemon.call(QStringLiteral("authenticatePassword"), { QLatin1String(name), QLatin1String(password) });
+        return call("authenticatePassword", name, password);
     }
     // The command line's exit code, a blank, its output and what it wrote to stderr after "stderr: ".
     QByteArray client(const char *option, const QByteArray &argument = QByteArray()) const
     {
         QProcess client;
         client.start(CacheDaemonFixture::programPath(),
-            QStringList { QLatin1String(option) }
-                + (argument.isNull() ? QStringList() : QStringList { QString::fromUtf8(argument) }));
+            QStringList { QLatin1String(option), QString::fromUtf8(argument) }.mid(0, argument.isNull() ? 1 : 2));
         if (!client.waitForFinished(60000) || client.exitStatus() != QProcess::NormalExit)
             return "did not finish";
         const QByteArray err = client.readAllStandardError();
@@ -117,16 +113,16 @@ private Q_SLOTS:
         QCOMPARE(s->lookUp("@alice"), passTrue);
         QCOMPARE(loadRecord(10001)->password(), QStringLiteral("x"));
         QVERIFY(s->root.readFile(QStringLiteral("/var/lib/libkest-iam/groups.txt")).contains("@alice"));
-        QCOMPARE(s->daemon.call(QStringLiteral("queryUid"), { QStringLiteral("10002") }), passTrue);
+        QCOMPARE(s->call("queryUid", "10002"), passTrue);
         QCOMPARE(loadRecord(10002)->account(), QStringLiteral("@bob"));
-        QCOMPARE(s->daemon.call(QStringLiteral("queryUid"), { QStringLiteral("10077") }), passFalse);
+        QCOMPARE(s->call("queryUid", "10077"), passFalse);
 
         const QString home = s->root.filePath(QStringLiteral("/home/@alice"));
         QVERIFY(QDir().mkpath(home) && s->root.writeFile(QStringLiteral("/home/@alice/notes"), "x"));
         QCOMPARE(s->login("@alice", "wrong"), passFalse);
         QCOMPARE(loadRecord(10001)->password(), QStringLiteral("x"));
         QCOMPARE(s->login("@alice", "alice-password"), passTrue);
-        QCOMPARE(loadRecord(10001)->password(), digest("alice-password"));
+        QCOMPARE(loadRecord(10001)->password(), UserListManager::passwordDigest(QStringLiteral("alice-password")));
         QVERIFY(loadRecord(10001)->lastLoginTime() + 60 >= quint64(QDateTime::currentSecsSinceEpoch()));
         struct stat info;
         QCOMPARE(stat(QFile::encodeName(home).constData(), &info), 0);
@@ -240,7 +236,8 @@ private Q_SLOTS:
             QCOMPARE(out, "0 " + expected + '\n');
         // Only a change the server accepted replaces the digest kept for offline logins.
         const bool changed = expected == "code:0";
-        QCOMPARE(loadRecord(10001)->password(), digest(changed ? "new-pass" : "alice-password"));
+        QCOMPARE(loadRecord(10001)->password(),
+            UserListManager::passwordDigest(QLatin1String(changed ? "new-pass" : "alice-password")));
         QCOMPARE(s->login("@alice", "new-pass"), changed ? passTrue : passFalse);
     }
 
@@ -282,9 +279,8 @@ private Q_SLOTS:
         QCOMPARE(s->daemon.request(command(4, QStringLiteral("nope"))),
             result("[PasswordConfig] : pw-config json parse error!!!"));
         QCOMPARE(s->daemon.request(command(9, 1)), result("invalid command!!!"));
-        QCOMPARE(s->daemon.call(QStringLiteral("modifyUser"), { QStringLiteral("[]") }), status(1, "json解析失败"));
-        QCOMPARE(s->daemon.call(QStringLiteral("modifyUser"), { QStringLiteral(R"({"username":"@alice"})") }),
-            status(2, "json解析失败,缺少必要的字段"));
+        QCOMPARE(s->call("modifyUser", "[]"), status(1, "json解析失败"));
+        QCOMPARE(s->call("modifyUser", R"({"username":"@alice"})"), status(2, "json解析失败,缺少必要的字段"));
     }
 
     void commandLineAndLifecycle()
