@@ -181,10 +181,9 @@ QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJs
         QStringList arguments;
         for (const QJsonValue &argument : argv)
             arguments.append(argument.toString());
-        bool known = false;
         // The service may wait on the domain server in a nested event loop, where the peer can vanish.
         const QPointer<QTcpSocket> guard(socket);
-        const QString result = callService(name, arguments, known);
+        const QString result = callService(name, arguments);
         if (!guard)
             return result;
         const QByteArray payload = QJsonDocument::fromJson(result.toUtf8()).toJson(QJsonDocument::Compact);
@@ -199,9 +198,8 @@ QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJs
     return QString();
 }
 
-QString KestCacheLocalServer::callService(const QString &name, const QStringList &arguments, bool &known)
+QString KestCacheLocalServer::callService(const QString &name, const QStringList &arguments)
 {
-    known = true;
     if (name == QLatin1String("queryAccountName"))
         return m_service->queryAccountName(arguments.at(0));
     if (name == QLatin1String("queryUid"))
@@ -214,7 +212,6 @@ QString KestCacheLocalServer::callService(const QString &name, const QStringList
         return m_service->authenticatePassword(arguments.at(0), arguments.at(1));
     if (name == QLatin1String("modifyUser"))
         return m_service->modifyUser(arguments.at(0));
-    known = false;
     return QString();
 }
 

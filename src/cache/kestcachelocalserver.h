@@ -36,7 +36,7 @@ private:
     QString sendResultReply(QTcpSocket *socket, int retVal, const QString &text);
     QString sendStatusReply(QTcpSocket *socket, int code, const QString &text);
     QString dispatchFunctionCall(QTcpSocket *socket, const QJsonObject &request);
-    QString callService(const QString &name, const QStringList &arguments, bool &known);
+    QString callService(const QString &name, const QStringList &arguments);
     void handleServerCommand(QTcpSocket *socket, const QJsonObject &request);
     QString cleanCache(QTcpSocket *socket, const QJsonValue &data);
     QString cleanCacheNotInList(QTcpSocket *socket, const QJsonValue &data);
