@@ -1,7 +1,10 @@
 #!/usr/bin/env bash
 # make-test-certs.sh DIR - generates throw-away TLS material for the tests and the demonstration:
-# a CA, a server certificate for the loopback addresses and a client certificate, all signed by the CA.
+# a CA, a server certificate for the loopback addresses and a client certificate, all signed by the CA,
+# and server certificates a client must refuse or may take:
 #   DIR/ca.pem DIR/ca.key  DIR/server.pem DIR/server.key  DIR/client.pem DIR/client.key
+#   DIR/selfsigned.*  (not signed by the CA)  DIR/expired.*  (signed, but its time is over)
+#   DIR/nosan.*  (signed, names no address: fine for a server reached by its literal address)
 # Keys are written mode 0600 and belong in DIR only: never commit them.
 set -euo pipefail
 
@@ -52,4 +55,37 @@ sign client "/O=kest-iam tests/CN=kest-test-client" \
 keyUsage=critical,digitalSignature,keyEncipherment
 extendedKeyUsage=clientAuth"
 
-chmod 0644 ca.pem server.pem client.pem
+server_ext="basicConstraints=CA:FALSE
+keyUsage=critical,digitalSignature,keyEncipherment
+extendedKeyUsage=serverAuth"
+sign nosan "/O=kest-iam tests/CN=kest-test-nosan" "$server_ext"
+
+new_key selfsigned.key
+quiet openssl req -new -x509 -sha256 -days "$days" -key selfsigned.key -subj "/O=kest-iam tests/CN=kest-test-domain-server" \
+    -addext "subjectAltName=IP:127.0.0.2,IP:127.0.0.1,DNS:localhost" -out selfsigned.pem
+
+# "openssl ca" is the one signer that takes dates in the past.
+new_key expired.key
+quiet openssl req -new -sha256 -key expired.key -subj "/O=kest-iam tests/CN=kest-test-domain-server" -out "$work/expired.csr"
+touch "$work/index.txt"
+openssl rand -hex 8 >"$work/serial"
+cat >"$work/ca.cnf" <<EOF
+[ca]
+default_ca = test
+[test]
+database = $work/index.txt
+new_certs_dir = $work
+serial = $work/serial
+policy = anything
+default_md = sha256
+x509_extensions = server
+[anything]
+commonName = supplied
+[server]
+$server_ext
+subjectAltName=IP:127.0.0.2,IP:127.0.0.1,DNS:localhost
+EOF
+quiet openssl ca -batch -config "$work/ca.cnf" -cert ca.pem -keyfile ca.key -startdate 20200101000000Z \
+    -enddate 20200201000000Z -notext -in "$work/expired.csr" -out expired.pem
+
+chmod 0644 ca.pem server.pem client.pem nosan.pem selfsigned.pem expired.pem

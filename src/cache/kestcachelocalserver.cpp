@@ -4,6 +4,7 @@
 #include "kestcacheservice.h"
 #include "kestpaths.h"
 #include "passwordpolicy.h"
+#include "peeruid.h"
 
 #include <QDebug>
 #include <QFile>
@@ -14,6 +15,8 @@
 #include <QTcpSocket>
 #include <QTimer>
 #include <QtEndian>
+
+#include <sys/socket.h>
 
 namespace
 {
@@ -71,7 +74,12 @@ void KestCacheLocalServer::onAcceptError(QAbstractSocket::SocketError error)
 
 void KestCacheLocalServer::onDisconnected()
 {
-    if (auto *socket = qobject_cast<QTcpSocket *>(sender()))
+    auto *socket = qobject_cast<QTcpSocket *>(sender());
+    if (!socket)
+        return;
+    if (m_busy)
+        m_closed.append(socket);
+    else
         socket->deleteLater();
 }
 
@@ -80,6 +88,31 @@ void KestCacheLocalServer::onReadyRead()
     auto *socket = qobject_cast<QTcpSocket *>(sender());
     if (!socket)
         return;
+    if (m_busy) {
+        if (!m_waiting.contains(socket))
+            m_waiting.append(socket);
+        return;
+    }
+    readRequest(socket);
+    takeWaitingRequests();
+}
+
+void KestCacheLocalServer::takeWaitingRequests()
+{
+    while (!m_waiting.isEmpty()) {
+        const QPointer<QTcpSocket> socket = m_waiting.takeFirst();
+        if (socket)
+            readRequest(socket);
+    }
+    for (const QPointer<QTcpSocket> &socket : qAsConst(m_closed)) {
+        if (socket)
+            socket->deleteLater();
+    }
+    m_closed.clear();
+}
+
+void KestCacheLocalServer::readRequest(QTcpSocket *socket)
+{
     // Strictly more than the length prefix: an empty frame waits for further bytes.
     if (socket->bytesAvailable() <= 4) {
         watchPartialFrame(socket);
@@ -98,7 +131,9 @@ void KestCacheLocalServer::onReadyRead()
     }
     socket->read(4);
     const QByteArray payload = socket->read(length);
+    m_busy = true;
     handleRequest(socket, payload);
+    m_busy = false;
     watchPartialFrame(socket);
 }
 
@@ -138,6 +173,23 @@ void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &p
         handleServerCommand(socket, request);
     else
         dispatchFunctionCall(socket, request);
+}
+
+// The service may have waited on the domain server long enough for the peer to give up.
+bool KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &framed)
+{
+    char byte;
+    const bool peerLeft = socket->state() != QAbstractSocket::ConnectedState
+        || recv(int(socket->socketDescriptor()), &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0;
+    if (peerLeft) {
+        const QString reason = socket->error() == QAbstractSocket::UnknownSocketError
+            ? QStringLiteral("The remote host closed the connection")
+            : socket->errorString();
+        qWarning().noquote() << QStringLiteral("socket error: ") + reason;
+        return false;
+    }
+    socket->write(framed);
+    return true;
 }
 
 void KestCacheLocalServer::sendErrorReply(QTcpSocket *socket, const QString &text)
@@ -181,17 +233,9 @@ QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJs
         QStringList arguments;
         for (const QJsonValue &argument : argv)
             arguments.append(argument.toString());
-        // The service may wait on the domain server in a nested event loop, where the peer can vanish.
-        const QPointer<QTcpSocket> guard(socket);
         const QString result = callService(name, arguments);
-        if (!guard)
-            return result;
         const QByteArray payload = QJsonDocument::fromJson(result.toUtf8()).toJson(QJsonDocument::Compact);
-        if (socket->state() != QAbstractSocket::ConnectedState) {
-            qWarning().noquote() << QStringLiteral("socket error: ") + socket->errorString();
-            return result;
-        }
-        socket->write(frame(payload));
+        writeReply(socket, frame(payload));
         return result;
     }
     sendErrorReply(socket, QStringLiteral("Function name not defined !!!"));
@@ -222,7 +266,10 @@ void KestCacheLocalServer::handleServerCommand(QTcpSocket *socket, const QJsonOb
         return;
     }
     const QJsonValue data = request.value(QLatin1String("data"));
-    switch (request.value(QLatin1String("command")).toInt()) {
+    const int command = request.value(QLatin1String("command")).toInt();
+    if (command >= 1 && command <= 4 && !isRootPeer(socket, command))
+        return;
+    switch (command) {
     case 1:
         qDebug().noquote() << QStringLiteral("---------------ServerCommand::CleanCache");
         cleanCache(socket, data);
@@ -246,6 +293,20 @@ void KestCacheLocalServer::handleServerCommand(QTcpSocket *socket, const QJsonOb
     default:
         sendResultReply(socket, 1, QStringLiteral("invalid command!!!"));
     }
+}
+
+// Deleting caches and rewriting the policy are root's alone; whoever cannot be identified is refused.
+bool KestCacheLocalServer::isRootPeer(QTcpSocket *socket, int command)
+{
+    uid_t uid = 0;
+    const bool known
+        = PeerUid::lookup(socket->peerAddress(), socket->peerPort(), socket->localAddress(), socket->localPort(), uid);
+    if (known && uid == 0)
+        return true;
+    const qint64 shown = known ? qint64(uid) : -1;
+    qWarning().noquote() << QStringLiteral("refused server command %1 from uid %2.").arg(command).arg(shown);
+    sendResultReply(socket, 1, QStringLiteral("permission denied !!!"));
+    return false;
 }
 
 QString KestCacheLocalServer::cleanCache(QTcpSocket *socket, const QJsonValue &data)
@@ -314,9 +375,7 @@ QString KestCacheLocalServer::modifyUserPassword(QTcpSocket *socket, const QJson
     if (!request.contains(QLatin1String("username")) || !request.contains(QLatin1String("password"))
         || !request.contains(QLatin1String("old_password")))
         return sendStatusReply(socket, 2, QStringLiteral("请求消息缺少必要的字段,username,password,old_password"));
-    const QPointer<QTcpSocket> guard(socket);
     const QString reply = m_service->modifyUser(text);
-    if (guard)
-        socket->write(frame(reply.toUtf8()));
+    writeReply(socket, frame(reply.toUtf8()));
     return reply;
 }

@@ -1,6 +1,8 @@
 #pragma once
 
 #include <QJsonObject>
+#include <QList>
+#include <QPointer>
 #include <QTcpServer>
 
 #include <memory>
@@ -30,7 +32,10 @@ private Q_SLOTS:
     void onDisconnected();
 
 private:
+    void readRequest(QTcpSocket *socket);
+    void takeWaitingRequests();
     void handleRequest(QTcpSocket *socket, const QByteArray &payload);
+    bool writeReply(QTcpSocket *socket, const QByteArray &framed);
     void watchPartialFrame(QTcpSocket *socket);
     void sendErrorReply(QTcpSocket *socket, const QString &text);
     QString sendResultReply(QTcpSocket *socket, int retVal, const QString &text);
@@ -38,6 +43,7 @@ private:
     QString dispatchFunctionCall(QTcpSocket *socket, const QJsonObject &request);
     QString callService(const QString &name, const QStringList &arguments);
     void handleServerCommand(QTcpSocket *socket, const QJsonObject &request);
+    bool isRootPeer(QTcpSocket *socket, int command);
     QString cleanCache(QTcpSocket *socket, const QJsonValue &data);
     QString cleanCacheNotInList(QTcpSocket *socket, const QJsonValue &data);
     QString updateCache(QTcpSocket *socket, const QJsonValue &data);
@@ -45,4 +51,9 @@ private:
     QString modifyUserPassword(QTcpSocket *socket, const QJsonValue &data);
 
     std::unique_ptr<KestCacheService> m_service;
+    // One request at a time: while one is answered, other sockets wait here in the order they became
+    // readable, and sockets whose peers left are deleted only afterwards.
+    bool m_busy = false;
+    QList<QPointer<QTcpSocket>> m_waiting;
+    QList<QPointer<QTcpSocket>> m_closed;
 };

@@ -6,23 +6,15 @@
 #include "homedirectoryrepair.h"
 #include "httphelper.h"
 #include "offlinelogin.h"
+#include "serverreachability.h"
 #include "userlistmanager.h"
 
 #include <QDebug>
 #include <QJsonDocument>
 #include <QThread>
 
-#include <cerrno>
-#include <ctime>
+#include <chrono>
 #include <limits>
-#include <mutex>
-#include <thread>
-
-// Shared with the detached worker so that it never signals a service that is gone.
-struct KestCacheWorkerState {
-    std::mutex mutex;
-    bool serviceAlive = true;
-};
 
 namespace
 {
@@ -33,47 +25,70 @@ QString threadId()
 {
     return QString::number(reinterpret_cast<quintptr>(QThread::currentThreadId()));
 }
-
-void sleepOneSecond()
-{
-    struct timespec remaining = { 1, 0 };
-    while (nanosleep(&remaining, &remaining) != 0 && errno == EINTR) { }
-}
 } // namespace
 
 KestCacheService::KestCacheService(QObject *parent)
     : QObject(parent)
-    , m_http(std::make_unique<HttpHelper>())
+    , m_reachability(std::make_shared<ServerReachability>())
+    , m_http(std::make_unique<HttpHelper>(m_reachability))
     , m_groups(std::make_unique<GroupListManager>())
     , m_users(std::make_unique<UserListManager>(m_groups.get()))
-    , m_worker(std::make_shared<KestCacheWorkerState>())
 {
     connect(this, &KestCacheService::updateCache, this, &KestCacheService::onUpdateCache, Qt::AutoConnection);
-    std::thread(waitForServer, this, m_worker).detach();
 }
 
 KestCacheService::~KestCacheService()
 {
-    std::lock_guard<std::mutex> lock(m_worker->mutex);
-    m_worker->serviceAlive = false;
+    stopWorker();
 }
 
-void KestCacheService::waitForServer(KestCacheService *service, std::shared_ptr<KestCacheWorkerState> state)
+void KestCacheService::startWorker()
 {
-    auto http = std::make_unique<HttpHelper>();
-    QString hostPort;
-    // Wait while the domain server cannot be reached, then refresh once.
-    while (!http->checkServerAddress(hostPort)) {
-        sleepOneSecond();
-        std::lock_guard<std::mutex> lock(state->mutex);
-        if (!state->serviceAlive)
-            return;
-    }
-    std::lock_guard<std::mutex> lock(state->mutex);
-    if (!state->serviceAlive)
+    if (m_worker.joinable())
         return;
-    qInfo().noquote() << QStringLiteral("==================>> Q_EMIT updateCache, thread id: ") + threadId();
-    Q_EMIT service->updateCache();
+    m_stopWorker = false;
+    m_worker = std::thread(&KestCacheService::watchServer, this);
+}
+
+void KestCacheService::stopWorker()
+{
+    if (!m_worker.joinable())
+        return;
+    {
+        std::lock_guard<std::mutex> lock(m_workerMutex);
+        m_stopWorker = true;
+    }
+    m_workerWake.notify_all();
+    m_worker.join();
+}
+
+bool KestCacheService::sleepUnlessStopped()
+{
+    std::unique_lock<std::mutex> lock(m_workerMutex);
+    return !m_workerWake.wait_for(lock, std::chrono::seconds(1), [this]() { return m_stopWorker.load(); });
+}
+
+// Probes once a second while the server is out of reach (or not yet refreshed); the first success
+// refreshes the local users once, and any success ends an outage.
+void KestCacheService::watchServer()
+{
+    HttpHelper http(m_reachability);
+    bool refreshed = false;
+    do {
+        if (refreshed && !m_reachability->isUnreachable())
+            continue;
+        QString hostPort;
+        if (!http.checkServerAddress(hostPort, &m_stopWorker) || refreshed)
+            continue;
+        refreshed = true;
+        qInfo().noquote() << QStringLiteral("==================>> Q_EMIT updateCache, thread id: ") + threadId();
+        Q_EMIT updateCache();
+    } while (sleepUnlessStopped());
+}
+
+void KestCacheService::beginCall()
+{
+    m_http->setCallDeadline(QDeadlineTimer(callNetworkBudgetMs));
 }
 
 void KestCacheService::onUpdateCache()
@@ -83,6 +98,7 @@ void KestCacheService::onUpdateCache()
         cleanDomainUserCacheFiles();
         return;
     }
+    m_http->setCallDeadline(QDeadlineTimer(QDeadlineTimer::Forever));
     m_users->rebuildUsers(m_http.get());
 }
 
@@ -159,6 +175,7 @@ QString KestCacheService::queryAccountName(QString name)
 {
     if (!isEnabled())
         return passReply(false);
+    beginCall();
     const QString reply = m_http->queryUserByName(name);
     return answerLookup(reply, m_users->hasUserName(name),
         QStringLiteral("offline cache doesnot persist account name: ") + name,
@@ -169,6 +186,7 @@ QString KestCacheService::queryUid(uint uid)
 {
     if (!isEnabled())
         return passReply(false);
+    beginCall();
     const QString reply = m_http->queryUserByUid(uid);
     const QString id = QString::number(uid);
     return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
@@ -200,6 +218,7 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
             "password should not be x because linux use it to express encrypted password meaning.");
         return passReply(false);
     }
+    beginCall();
     const QString reply = m_http->authenticate(username, password, QStringLiteral("password"));
     if (reply == HttpHelper::unreachableReply()) {
         if (!checkOfflineLogin(username) || !m_users->checkOfflinePassword(username, password))
@@ -254,6 +273,7 @@ QString KestCacheService::modifyUser(QString json)
         qWarning().noquote() << QStringLiteral("donot validate for not remote account.");
         return statusReply(3, QStringLiteral("校验域账号失败,不能查询到此账户信息"));
     }
+    beginCall();
     const QString reply = m_http->resetPassword(uid, userName, newPassword, oldPassword);
     if (reply == HttpHelper::unreachableReply() || reply == HttpHelper::refusedReply()) {
         qWarning().noquote() << QStringLiteral("network error or donot authenticate pass.");

@@ -4,12 +4,16 @@
 #include <QObject>
 #include <QString>
 
+#include <atomic>
+#include <condition_variable>
 #include <memory>
+#include <mutex>
+#include <thread>
 
 class GroupListManager;
 class HttpHelper;
+class ServerReachability;
 class UserListManager;
-struct KestCacheWorkerState;
 
 // The cache daemon's engine: account look-ups, password checks and password changes against the
 // domain server, with the local account files and cache records as the offline fallback.
@@ -26,6 +30,14 @@ public:
 
     UserListManager *userList() const;
 
+    // The update worker runs only while the daemon listens, and is stopped before anything it uses
+    // is torn down.
+    void startWorker();
+    void stopWorker();
+
+    // All the network time one function call may take, so that callers waiting 5 s always get an answer.
+    static const int callNetworkBudgetMs = 4000;
+
     static QString passReply(bool pass);
 
 Q_SIGNALS:
@@ -41,15 +53,21 @@ public Q_SLOTS:
     void onUpdateCache();
 
 private:
-    static void waitForServer(KestCacheService *service, std::shared_ptr<KestCacheWorkerState> state);
+    void watchServer();
+    bool sleepUnlessStopped();
+    void beginCall();
     static bool validateServerAnswer(const QString &reply, const QString &password, QJsonObject &user);
     static QString statusReply(int code, const QString &message);
     QString answerLookup(
         const QString &reply, bool known, const QString &offlineMessage, const QString &unknownMessage);
     bool isEnabled() const;
 
+    std::shared_ptr<ServerReachability> m_reachability;
     std::unique_ptr<HttpHelper> m_http;
     std::unique_ptr<GroupListManager> m_groups;
     std::unique_ptr<UserListManager> m_users;
-    std::shared_ptr<KestCacheWorkerState> m_worker;
+    std::thread m_worker;
+    std::mutex m_workerMutex;
+    std::condition_variable m_workerWake;
+    std::atomic<bool> m_stopWorker { false };
 };

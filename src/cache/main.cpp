@@ -45,7 +45,8 @@ int runDaemon(QCoreApplication &app)
         qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
     QObject::connect(&terminate, &TerminateSignalNotifier::received, &app, &QCoreApplication::quit);
 
-    KestCacheLocalServer server(new KestCacheService);
+    auto *service = new KestCacheService;
+    KestCacheLocalServer server(service);
     const int port = GlobalSetting::instance()->port();
     if (!server.listen(QHostAddress(QStringLiteral("127.0.0.1")), quint16(port))) {
         qCritical().noquote() << QStringLiteral("cannot listen on 127.0.0.1:") + QString::number(port)
@@ -55,12 +56,22 @@ int runDaemon(QCoreApplication &app)
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
+    service->startWorker();
 
     const int result = app.exec();
+    service->stopWorker();
     server.close();
     QFile::remove(KestPaths::cachePidFile());
     qInfo().noquote() << QStringLiteral("cache service stopped.");
     return result;
+}
+
+QByteArray readStandardInput()
+{
+    QFile input;
+    if (!input.open(stdin, QIODevice::ReadOnly))
+        return QByteArray();
+    return input.read(KestCacheLocalServer::maximumFrameLength).trimmed();
 }
 
 quint16 daemonPort()
@@ -132,7 +143,8 @@ int main(int argc, char *argv[])
                 QStringLiteral("UID")) },
         { 5,
             QCommandLineOption(QStringLiteral("modify-user-passwd"),
-                QStringLiteral("Change a password: {\"username\",\"password\",\"old_password\"}."),
+                QStringLiteral("Change a password: {\"username\",\"password\",\"old_password\"}, or - to read it "
+                               "from standard input."),
                 QStringLiteral("JSON")) },
         { 6,
             QCommandLineOption(QStringLiteral("show-cache"),
@@ -143,8 +155,13 @@ int main(int argc, char *argv[])
     parser.process(app);
 
     for (const auto &command : commands) {
-        if (parser.isSet(command.second))
-            return runClient(app, command.first, parser.value(command.second).toUtf8());
+        if (!parser.isSet(command.second))
+            continue;
+        QByteArray argument = parser.value(command.second).toUtf8();
+        // "-": the JSON comes on standard input, so that no password stands on a command line.
+        if (command.first == 5 && argument == "-")
+            argument = readStandardInput();
+        return runClient(app, command.first, argument);
     }
     QTextStream(stderr) << parser.helpText();
     return 1;

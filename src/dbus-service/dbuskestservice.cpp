@@ -39,10 +39,15 @@ QString errorText(const QDBusError &error)
 }
 
 // Output of a finished child; a child still running is killed so that the service never leaves one behind.
-QByteArray runChild(const QString &program, const QStringList &arguments, QByteArray *errorOutput = nullptr)
+QByteArray runChild(const QString &program, const QStringList &arguments, QByteArray *errorOutput = nullptr,
+    const QByteArray &input = QByteArray())
 {
     QProcess process;
     process.start(program, arguments, QIODevice::ReadWrite);
+    if (!input.isEmpty() && process.waitForStarted(kChildProcessTimeoutMs)) {
+        process.write(input);
+        process.closeWriteChannel();
+    }
     process.waitForFinished(kChildProcessTimeoutMs);
     const QByteArray output = process.readAllStandardOutput();
     if (errorOutput)
@@ -166,7 +171,7 @@ bool DBusKestService::registerUserObjects(QDBusConnection connection)
         m_users.insert(uid, user);
         const QString path = kUserObjectPath + QString::number(uid);
         qDebug().noquote() << QStringLiteral("uid=") + QString::number(uid) + QStringLiteral("userPath=") + path;
-        if (!connection.registerObject(path, user.data(), QDBusConnection::ExportAllContents)) {
+        if (!connection.registerVirtualObject(path, user.data())) {
             qWarning().noquote() << QStringLiteral("register user dbus object failed. error: ")
                     + errorText(connection.lastError());
             return false;
@@ -268,9 +273,10 @@ QString DBusKestService::ModifyUserPassword(
 {
     const QJsonObject request { { QStringLiteral("username"), userName }, { QStringLiteral("password"), newPassword },
         { QStringLiteral("old_password"), old_password } };
-    QByteArray output = runChild(QStringLiteral("cache-kest"),
-        { QStringLiteral("--modify-user-passwd"),
-            QString::fromUtf8(QJsonDocument(request).toJson(QJsonDocument::Compact)) });
+    // On standard input: every local user can read a command line in /proc.
+    QByteArray output
+        = runChild(QStringLiteral("cache-kest"), { QStringLiteral("--modify-user-passwd"), QStringLiteral("-") },
+            nullptr, QJsonDocument(request).toJson(QJsonDocument::Compact));
     const int zero = output.indexOf('\0');
     if (zero >= 0)
         output.truncate(zero);

@@ -2,11 +2,13 @@
 
 #include "userlistmanager.h"
 
-#include <QObject>
+#include <QDBusVirtualObject>
 #include <QString>
+#include <QVariantMap>
 
 // The read-only account entry of one cached network user, published at /com/nimbal/kest/iam/user<uid>.
-class DBusKestServiceUser : public QObject
+// Its properties are served by hand, not by QtDBus, because what Password shows depends on the caller.
+class DBusKestServiceUser : public QDBusVirtualObject
 {
     Q_OBJECT
     Q_CLASSINFO("D-Bus Interface", "com.nimbal.kest.iam.user")
@@ -33,6 +35,14 @@ public:
     QString shell() const;
     QString gecos() const;
 
+    QString introspect(const QString &path) const override;
+    bool handleMessage(const QDBusMessage &message, const QDBusConnection &connection) override;
+
+    static const QString interfaceName;
+
 private:
+    QVariantMap properties(bool withPassword) const;
+    bool callerMayReadPassword(const QDBusMessage &message, const QDBusConnection &connection) const;
+
     UserEntryPtr m_entry;
 };

@@ -2,23 +2,22 @@
 
 #include "globalsetting.h"
 #include "kestpaths.h"
+#include "serverreachability.h"
 
+#include <QDateTime>
 #include <QDebug>
-#include <QEventLoop>
 #include <QFile>
+#include <QFileInfo>
 #include <QHostAddress>
 #include <QJsonArray>
 #include <QJsonParseError>
 #include <QMetaEnum>
-#include <QNetworkAccessManager>
-#include <QNetworkRequest>
+#include <QNetworkProxy>
 #include <QSslCertificate>
-#include <QSslConfiguration>
 #include <QSslKey>
 #include <QSslSocket>
 #include <QTcpSocket>
 #include <QTextStream>
-#include <QTimer>
 #include <QUrl>
 
 #include <initializer_list>
@@ -28,6 +27,7 @@
 namespace
 {
 const int connectTimeoutMs = 5000;
+const int probeSliceMs = 100;
 
 void warn(const QString &text)
 {
@@ -49,6 +49,29 @@ bool isLiteralAddress(const QString &host)
 {
     QHostAddress address;
     return address.setAddress(host);
+}
+
+QString hostPortText(const QString &address, int port)
+{
+    const bool ipv6 = QHostAddress(address).protocol() == QAbstractSocket::IPv6Protocol;
+    return (ipv6 ? QLatin1Char('[') + address + QLatin1Char(']') : address) + QLatin1Char(':') + QString::number(port);
+}
+
+// Names the TLS files as they are now, so that an edited or replaced file rebuilds the configuration.
+QString fileStamp(const QString &path)
+{
+    const QFileInfo info(path);
+    return path + QLatin1Char('@') + QString::number(info.lastModified().toMSecsSinceEpoch()) + QLatin1Char('/')
+        + QString::number(info.size());
+}
+
+QByteArray requestText(const QString &path, const QString &hostPort, const QByteArray &method, const QByteArray &body)
+{
+    const QByteArray target = path.startsWith(QLatin1Char('/')) ? path.toUtf8() : '/' + path.toUtf8();
+    return method + ' ' + target + " HTTP/1.1\r\nHost: " + hostPort.toUtf8()
+        + "\r\nContent-Type: application/json\r\nUser-Agent: KEST\r\nAccept: application/json\r\n"
+          "Connection: keep-alive\r\nContent-Length: "
+        + QByteArray::number(body.size()) + "\r\n\r\n" + body;
 }
 
 QByteArray jsonText(const QJsonValue &value)
@@ -88,10 +111,13 @@ QJsonObject withLocalName(QJsonObject object, const QString &localName)
 }
 } // namespace
 
-HttpHelper::HttpHelper(QObject *parent)
+HttpHelper::HttpHelper(std::shared_ptr<ServerReachability> reachability, QObject *parent)
     : QObject(parent)
+    , m_reachability(reachability ? std::move(reachability) : std::make_shared<ServerReachability>())
 {
 }
+
+HttpHelper::~HttpHelper() = default;
 
 const QString &HttpHelper::refusedReply()
 {
@@ -111,7 +137,13 @@ const QString &HttpHelper::unknownAccountReply()
     return text;
 }
 
-bool HttpHelper::checkServerAddress(QString &hostPort)
+QDeadlineTimer HttpHelper::requestDeadline(int milliseconds) const
+{
+    const QDeadlineTimer own(milliseconds);
+    return own.deadlineNSecs() < m_callDeadline.deadlineNSecs() ? own : m_callDeadline;
+}
+
+bool HttpHelper::checkServerAddress(QString &hostPort, const std::atomic<bool> *cancel)
 {
     if (!QFile::exists(KestPaths::settingsFile())) {
         warn(QStringLiteral("configuration file is broken."));
@@ -120,116 +152,117 @@ bool HttpHelper::checkServerAddress(QString &hostPort)
     const GlobalSetting *settings = GlobalSetting::instance();
     const QString address = settings->serverAddress();
     const int port = settings->port();
-    hostPort = QStringLiteral("%1:%2").arg(address, QString::number(port));
+    hostPort = hostPortText(address, port);
 
     // Blocking calls only: the update worker probes from a thread that has no event loop.
     QTcpSocket socket;
+    socket.setProxy(QNetworkProxy::NoProxy);
     socket.connectToHost(QHostAddress(address), static_cast<quint16>(port));
-    socket.waitForConnected(connectTimeoutMs);
+    const QDeadlineTimer deadline = requestDeadline(connectTimeoutMs);
+    while (socket.state() != QAbstractSocket::ConnectedState && socket.state() != QAbstractSocket::UnconnectedState
+        && !deadline.hasExpired() && !(cancel && cancel->load()))
+        socket.waitForConnected(int(qBound<qint64>(0, deadline.remainingTime(), probeSliceMs)));
     if (socket.state() != QAbstractSocket::ConnectedState) {
-        warn(QStringLiteral("error host address: ") + hostPort + QStringLiteral(", error detail: ")
-            + socket.errorString());
+        const QString detail = socket.state() == QAbstractSocket::UnconnectedState
+            ? socket.errorString()
+            : QStringLiteral("Socket operation timed out");
+        m_reachability->markUnreachable(hostPort, detail);
         return false;
     }
+    m_reachability->markReachable();
     return true;
 }
 
-void HttpHelper::configureSsl(QNetworkRequest &request)
+bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configuration)
 {
     const GlobalSetting *settings = GlobalSetting::instance();
-    if (settings->protocol() != QLatin1String("https://"))
-        return;
-
-    QSslConfiguration configuration = QSslConfiguration::defaultConfiguration();
-    const QList<QSslCertificate> authorities = certificatesIn(settings->serverCert());
-    if (authorities.isEmpty())
-        warn(QStringLiteral("cannot set server key."));
-    else
-        configuration.setCaCertificates(authorities);
-
-    const QList<QSslCertificate> chain = certificatesIn(settings->publicKey());
-    if (chain.isEmpty())
-        warn(QStringLiteral("cannot set local public key."));
-    else
-        configuration.setLocalCertificateChain(chain);
-
+    const QString caPath = settings->serverCert();
+    const QString chainPath = settings->publicKey();
     const QString keyPath = settings->privateKey();
-    QFile keyFile(keyPath);
-    if (keyPath.isEmpty() || !keyFile.open(QIODevice::ReadOnly))
-        warn(QStringLiteral("cannot read local private key."));
-    else
-        configuration.setPrivateKey(QSslKey(&keyFile, QSsl::Rsa, QSsl::Pem, QSsl::PrivateKey));
-
-    // A certificate cannot name every address a server is reached by; onSslError goes on likewise.
-    if (isLiteralAddress(settings->serverAddress()))
-        configuration.setPeerVerifyMode(QSslSocket::QueryPeer);
-    request.setSslConfiguration(configuration);
-}
-
-QNetworkReply *HttpHelper::sendRequest(const QString &url, const QByteArray &method, const QByteArray &body, bool wait)
-{
-    QNetworkRequest request { QUrl(url) };
-    request.setHeader(QNetworkRequest::ContentTypeHeader, QStringLiteral("application/json"));
-    request.setHeader(QNetworkRequest::UserAgentHeader, QStringLiteral("KEST"));
-    request.setAttribute(QNetworkRequest::RedirectPolicyAttribute, QNetworkRequest::ManualRedirectPolicy);
-    // Empty, not null (a null value removes a header): Qt's HTTP layer then puts in its own values.
-    const QByteArray empty("");
-    request.setRawHeader("Connection", empty);
-    request.setRawHeader("Accept-Encoding", empty);
-    request.setRawHeader("Accept-Language", empty);
-    request.setRawHeader("Accept", "application/json");
-    configureSsl(request);
-
-    auto manager = std::make_unique<QNetworkAccessManager>();
-    // Direct: the decision to ignore the errors must be taken before the handshake goes on.
-    connect(manager.get(), &QNetworkAccessManager::sslErrors, this, &HttpHelper::onSslError, Qt::DirectConnection);
-    QNetworkReply *reply = manager->sendCustomRequest(request, method, body);
-    // The reply owns its manager, so that releasing the reply releases everything.
-    reply->setParent(nullptr);
-    manager.release()->setParent(reply);
-    connect(reply, &QNetworkReply::errorOccurred, this, &HttpHelper::onReplyError);
-
-    auto *timeout = new QTimer(reply);
-    timeout->setSingleShot(true);
-    connect(timeout, &QTimer::timeout, reply, &QNetworkReply::abort);
-    connect(reply, &QNetworkReply::finished, timeout, &QTimer::stop);
-    timeout->start(GlobalSetting::instance()->networkTimeout() * 1000);
-
-    if (wait && !reply->isFinished()) {
-        QEventLoop loop;
-        connect(reply, &QNetworkReply::finished, &loop, &QEventLoop::quit);
-        loop.exec();
+    const QString key = fileStamp(caPath) + QLatin1Char('|') + fileStamp(chainPath) + QLatin1Char('|')
+        + fileStamp(keyPath) + QLatin1Char('|') + QString::number(literalAddress);
+    if (key != m_tlsKey) {
+        m_tlsKey = key;
+        m_tlsConfiguration = QSslConfiguration::defaultConfiguration();
+        m_tlsConfiguration.setPeerVerifyMode(QSslSocket::VerifyPeer);
+        m_tlsConfiguration.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
+        // Exactly the configured authorities: the system's store would let any public CA vouch for an impostor.
+        const QList<QSslCertificate> authorities = certificatesIn(caPath);
+        m_tlsUsable = !authorities.isEmpty() || !literalAddress;
+        if (!authorities.isEmpty())
+            m_tlsConfiguration.setCaCertificates(authorities);
+        const QList<QSslCertificate> chain = certificatesIn(chainPath);
+        if (chain.isEmpty())
+            warn(QStringLiteral("cannot set local public key."));
+        else
+            m_tlsConfiguration.setLocalCertificateChain(chain);
+        QFile keyFile(keyPath);
+        if (keyPath.isEmpty() || !keyFile.open(QIODevice::ReadOnly))
+            warn(QStringLiteral("cannot read local private key."));
+        else
+            m_tlsConfiguration.setPrivateKey(QSslKey(&keyFile, QSsl::Rsa, QSsl::Pem, QSsl::PrivateKey));
     }
-    return reply;
+    if (m_tlsConfiguration.caCertificates().isEmpty() || !m_tlsUsable)
+        warn(QStringLiteral("cannot set server key."));
+    configuration = m_tlsConfiguration;
+    return m_tlsUsable;
 }
 
-int HttpHelper::parseReply(QNetworkReply *reply, QJsonDocument &document)
+bool HttpHelper::resolveTarget(Target &target)
 {
-    const int status = reply->attribute(QNetworkRequest::HttpStatusCodeAttribute).toInt();
-    // An aborted reply is closed, and reading a closed device makes Qt log a complaint of its own.
-    const QByteArray data = reply->isOpen() ? reply->readAll() : QByteArray();
+    const GlobalSetting *settings = GlobalSetting::instance();
+    const QString host = settings->ip();
+    const bool literal = isLiteralAddress(host);
+    const QString address = literal ? host : settings->serverAddress();
+    const int port = settings->port();
+    target.hostPort = hostPortText(address, port);
+    target.endpoint.address = QHostAddress(address);
+    target.endpoint.port = quint16(port);
+    target.endpoint.tls = settings->protocol() == QLatin1String("https://");
+    target.endpoint.verifyName = literal ? QString() : host;
+    QSslConfiguration configuration;
+    if (target.endpoint.tls && !configureSsl(literal, configuration))
+        return false;
+    target.endpoint.tlsKey = target.endpoint.tls ? m_tlsKey : QString();
+    m_connection.setEndpoint(target.endpoint, configuration);
+    return true;
+}
+
+DomainExchange HttpHelper::sendRequest(const QString &url, const QByteArray &method, const QByteArray &body)
+{
+    const QUrl parsed(url);
+    const QString path
+        = parsed.path(QUrl::FullyEncoded) + (parsed.hasQuery() ? QLatin1Char('?') + parsed.query() : QString());
+    const QString hostPort = parsed.authority(QUrl::FullyEncoded);
+    const QDeadlineTimer connectDeadline = requestDeadline(connectTimeoutMs);
+    const QDeadlineTimer deadline = requestDeadline(GlobalSetting::instance()->networkTimeout() * 1000);
+    return m_connection.exchange(requestText(path, hostPort, method, body), connectDeadline, deadline);
+}
+
+int HttpHelper::parseReply(
+    const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonDocument &document)
+{
+    const int status = reply.status;
     QJsonParseError error;
-    document = QJsonDocument::fromJson(data, &error);
+    document = QJsonDocument::fromJson(reply.body, &error);
     if (error.error != QJsonParseError::NoError) {
-        // The verb is the one sent; "Request Method" is not a header name that may go on the wire.
-        const QByteArray method = reply->request().attribute(QNetworkRequest::CustomVerbAttribute).toByteArray();
         warn(QStringLiteral("invalid reply data, parse error: ") + error.errorString() + QStringLiteral(", raw data: ")
-            + QString::fromUtf8(data) + QStringLiteral(", http status: ") + QString::number(status)
-            + QStringLiteral(", url: ") + reply->url().toString() + QStringLiteral(", method: ")
-            + QString::fromLatin1(method));
+            + QString::fromUtf8(reply.body) + QStringLiteral(", http status: ") + QString::number(status)
+            + QStringLiteral(", url: ") + url + QStringLiteral(", method: ") + QString::fromLatin1(method));
     }
     if (status != 200)
         warn(QStringLiteral("http response status is not ok. actual http status code: ") + QString::number(status));
     return status;
 }
 
-bool HttpHelper::checkReplyData(QNetworkReply *reply, QJsonObject &object)
+bool HttpHelper::checkReplyData(
+    const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonObject &object)
 {
     QJsonDocument document;
-    parseReply(reply, document);
+    parseReply(url, method, reply, document);
     object = document.object();
     if (!document.isObject() || !object.contains(QLatin1String("code")) || !object.contains(QLatin1String("msg"))) {
-        warn(QStringLiteral("http response data error. url: ") + reply->url().toString());
+        warn(QStringLiteral("http response data error. url: ") + url);
         return false;
     }
     return true;
@@ -248,19 +281,31 @@ QString HttpHelper::readMachineId()
 bool HttpHelper::exchange(
     PathSetting path, const QByteArray &method, const BodyBuilder &body, QJsonObject &object, QString &failure)
 {
-    QString hostPort;
-    if (!checkServerAddress(hostPort)) {
-        failure = unreachableReply();
+    failure = unreachableReply();
+    if (!QFile::exists(KestPaths::settingsFile())) {
+        warn(QStringLiteral("configuration file is broken."));
         return false;
     }
+    if (m_reachability->isUnreachable())
+        return false;
+    Target target;
+    if (!resolveTarget(target))
+        return false;
     const GlobalSetting *settings = GlobalSetting::instance();
-    const QString url = settings->protocol() + hostPort + (settings->*path)();
-    const std::unique_ptr<QNetworkReply> reply(sendRequest(url, method, body(), true));
-    if (!checkReplyData(reply.get(), object)) {
-        failure = refusedReply();
+    const QString url = settings->protocol() + target.hostPort + (settings->*path)();
+    const DomainExchange reply = sendRequest(url, method, body());
+    if (!reply.connected) {
+        m_reachability->markUnreachable(target.hostPort, reply.connectError);
         return false;
     }
-    return true;
+    if (reply.untrusted) {
+        onSslError(url, reply);
+        return false;
+    }
+    if (reply.error != QNetworkReply::NoError)
+        onReplyError(reply.error, url, reply.errorText);
+    failure = refusedReply();
+    return checkReplyData(url, method, reply, object);
 }
 
 QString HttpHelper::call(PathSetting path, const QByteArray &method, const BodyBuilder &body)
@@ -334,23 +379,18 @@ QString HttpHelper::queryDomain()
     return call(&GlobalSetting::domainUrl, "GET", []() { return QByteArray(); });
 }
 
-void HttpHelper::onSslError(QNetworkReply *reply, const QList<QSslError> &errors)
+void HttpHelper::onSslError(const QString &url, const DomainExchange &reply)
 {
-    if (isLiteralAddress(reply->url().host()))
-        reply->ignoreSslErrors(errors);
-    QString text = QStringLiteral("ssl error url: ") + reply->url().toString() + QStringLiteral(" certificate error: ")
-        + reply->errorString();
-    for (const QSslError &error : errors)
+    QString text = QStringLiteral("ssl error url: ") + url + QStringLiteral(" certificate error: ") + reply.errorText;
+    for (const QSslError &error : reply.sslErrors)
         text += QStringLiteral("\n    certificate error: ") + error.errorString();
     warn(text);
 }
 
-void HttpHelper::onReplyError(QNetworkReply::NetworkError error)
+void HttpHelper::onReplyError(QNetworkReply::NetworkError error, const QString &url, const QString &detail)
 {
-    const auto *reply = qobject_cast<const QNetworkReply *>(sender());
     const QMetaObject &meta = QNetworkReply::staticMetaObject;
     const QMetaEnum names = meta.enumerator(meta.indexOfEnumerator("NetworkError"));
-    warn(QStringLiteral("error code ") + QString::fromLatin1(names.valueToKey(error)) + QStringLiteral(" url: ")
-        + (reply ? reply->url().toString() : QString()) + QStringLiteral(", error detail: ")
-        + (reply ? reply->errorString() : QString()));
+    warn(QStringLiteral("error code ") + QString::fromLatin1(names.valueToKey(error)) + QStringLiteral(" url: ") + url
+        + QStringLiteral(", error detail: ") + detail);
 }

@@ -1,44 +1,52 @@
 #pragma once
 
+#include "domainconnection.h"
+
 #include <QByteArray>
+#include <QDeadlineTimer>
 #include <QJsonDocument>
 #include <QJsonObject>
 #include <QList>
 #include <QNetworkReply>
 #include <QObject>
+#include <QSslConfiguration>
 #include <QSslError>
 #include <QString>
 
+#include <atomic>
 #include <functional>
+#include <memory>
 
 class GlobalSetting;
-class QNetworkRequest;
+class ServerReachability;
 
 // Client of the domain server: one synchronous JSON request per call over HTTP or HTTPS, with every
 // address, path, certificate and time-out read from the settings file at the time of the call.
-//
-// Ownership: sendRequest makes a QNetworkAccessManager for each request and hands it to the reply it
-// returns, so deleting the reply (delete or deleteLater) releases both. The reply is the caller's.
-// The REST operations dispose of their replies themselves and return JSON text only.
+// One connection is kept alive between calls and rebuilt when the server or its TLS files change.
+// Nothing here runs an event loop: every wait blocks the calling thread until its deadline.
 class HttpHelper : public QObject
 {
     Q_OBJECT
 public:
-    explicit HttpHelper(QObject *parent = nullptr);
+    // Helpers that share a reachability see one outage: a failed connection stops the others from
+    // waiting on the network until a probe sees the server again.
+    explicit HttpHelper(std::shared_ptr<ServerReachability> reachability = nullptr, QObject *parent = nullptr);
+    ~HttpHelper() override;
 
     // The fixed failure texts; callers compare results with them byte for byte.
     static const QString &refusedReply();
     static const QString &unreachableReply();
     static const QString &unknownAccountReply();
 
-    // Blocking TCP probe of the domain server; safe on a thread without an event loop.
-    bool checkServerAddress(QString &hostPort);
-    void configureSsl(QNetworkRequest &request);
-    // With wait set the calling thread runs a local event loop until the reply has finished
-    // (or was aborted by the time-out); without it the caller's own event loop must run.
-    QNetworkReply *sendRequest(const QString &url, const QByteArray &method, const QByteArray &body, bool wait);
-    int parseReply(QNetworkReply *reply, QJsonDocument &document);
-    bool checkReplyData(QNetworkReply *reply, QJsonObject &object);
+    // Blocking TCP probe of the domain server; a set cancel flag ends the wait early.
+    bool checkServerAddress(QString &hostPort, const std::atomic<bool> *cancel = nullptr);
+    // Caps the network time of everything up to the next call of this (checks and requests alike).
+    void setCallDeadline(QDeadlineTimer deadline) { m_callDeadline = deadline; }
+    // False (and one warning) when a server given by its address could not be verified at all.
+    bool configureSsl(bool literalAddress, QSslConfiguration &configuration);
+    DomainExchange sendRequest(const QString &url, const QByteArray &method, const QByteArray &body);
+    int parseReply(const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonDocument &document);
+    bool checkReplyData(const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonObject &object);
     QString readMachineId();
 
     QString queryUserByName(const QString &name);
@@ -49,15 +57,28 @@ public:
     QString resetPassword(uint uid, const QString &username, const QString &password, const QString &oldPassword);
     QString queryDomain();
 
-public Q_SLOTS:
-    void onSslError(QNetworkReply *reply, const QList<QSslError> &errors);
-    void onReplyError(QNetworkReply::NetworkError error);
+    void onSslError(const QString &url, const DomainExchange &reply);
+    void onReplyError(QNetworkReply::NetworkError error, const QString &url, const QString &detail);
 
 private:
     using PathSetting = QString (GlobalSetting::*)() const;
     using BodyBuilder = std::function<QByteArray()>;
 
+    struct Target {
+        DomainEndpoint endpoint;
+        QString hostPort;
+    };
+
+    bool resolveTarget(Target &target);
+    QDeadlineTimer requestDeadline(int milliseconds) const;
     bool exchange(
         PathSetting path, const QByteArray &method, const BodyBuilder &body, QJsonObject &object, QString &failure);
     QString call(PathSetting path, const QByteArray &method, const BodyBuilder &body);
+
+    std::shared_ptr<ServerReachability> m_reachability;
+    DomainConnection m_connection;
+    QString m_tlsKey;
+    QSslConfiguration m_tlsConfiguration;
+    bool m_tlsUsable = false;
+    QDeadlineTimer m_callDeadline { QDeadlineTimer::Forever };
 };

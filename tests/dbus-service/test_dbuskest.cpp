@@ -385,10 +385,20 @@ private Q_SLOTS:
                 QStringLiteral("authenticatePassword"), { QStringLiteral("@alice"), QLatin1String(password) });
         };
         QCOMPARE(accepts("alice-password"), QByteArray("{\"pass\":true}"));
+        // The real client behind a wrapper that notes the command line, which every local user could read.
         const QString program = m_programs.filePath(QStringLiteral("cache-kest"));
-        QVERIFY(QFile::link(CacheDaemonFixture::programPath(), program));
+        const QString noted = m_programs.filePath(QStringLiteral("arguments"));
+        QFile wrapper(program);
+        QVERIFY(wrapper.open(QIODevice::WriteOnly));
+        wrapper.write("#!/bin/sh\necho \"$*\" >" + noted.toUtf8() + "\nexec "
+            + CacheDaemonFixture::programPath().toUtf8() + " \"$@\"\n");
+        wrapper.close();
+        QVERIFY(wrapper.setPermissions(QFile::ReadOwner | QFile::ExeOwner));
         const QVariant reply = call(QStringLiteral("ModifyUserPassword"), change);
         QFile::remove(program);
+        QFile arguments(noted);
+        QVERIFY(arguments.open(QIODevice::ReadOnly));
+        QCOMPARE(arguments.readAll(), QByteArray("--modify-user-passwd -\n"));
         // The domain server checks the old password; the new one must be the one accepted afterwards.
         QCOMPARE(QJsonDocument::fromJson(reply.toString().toUtf8()).object().value(QLatin1String("code")).toInt(-1), 0);
         QCOMPARE(accepts("new"), QByteArray("{\"pass\":true}"));
@@ -426,6 +436,26 @@ private Q_SLOTS:
         QVERIFY(client.waitForFinished(30000));
         QCOMPARE(client.exitCode() == 0, allowed);
         QCOMPARE(client.readAllStandardError().contains("org.freedesktop.DBus.Error.AccessDenied"), !allowed);
+    }
+
+    // Only root (userObjects) and the account itself see the stored digest. The bus takes only callers
+    // it can find groups for, so the account is one that exists here: nobody, cached as a domain account.
+    void passwordShownTo()
+    {
+        QVERIFY(writeRecord(65534, QStringLiteral("@nobody")));
+        announce("c4");
+        for (const uint uid : { 10002u, 65534u }) {
+            QProcess client;
+            client.start(QStringLiteral("setpriv"),
+                (kNobody + QStringLiteral("--clear-groups gdbus call --system --dest ") + kName
+                    + QStringLiteral(" --object-path ") + kPath + QStringLiteral("/user") + QString::number(uid)
+                    + QStringLiteral(" --method org.freedesktop.DBus.Properties.Get ") + kName
+                    + QStringLiteral(".user Password"))
+                    .split(QLatin1Char(' ')));
+            QVERIFY(client.waitForFinished(30000));
+            QCOMPARE(client.readAllStandardOutput().trimmed(),
+                uid == 65534 ? QByteArray("(<'digest-of-@nobody'>,)") : QByteArray("(<'x'>,)"));
+        }
     }
 
     // Last: it ends the service.

@@ -4,6 +4,8 @@
 #include "syslogcapture.h"
 #include "testroot.h"
 
+#include <QDateTime>
+#include <QFile>
 #include <QJsonDocument>
 #include <QRegularExpression>
 #include <QTcpServer>
@@ -108,6 +110,7 @@ private Q_SLOTS:
 
     void init()
     {
+        QVERIFY(showCertificate(QStringLiteral("server")));
         QVERIFY(m_server.setData(DomainServerFixture::defaultData()));
         QVERIFY(m_server.clearMisbehaviour() && m_server.clearRequests());
         SyslogCapture::clear();
@@ -153,6 +156,11 @@ private Q_SLOTS:
             << QStringList { QStringLiteral("error code ContentNotFoundError url: ") + user
                        + QStringLiteral(", error detail: *"),
                    notOk + QStringLiteral("404") };
+        QTest::newRow("closed without an answer: sent once")
+            << 0 << QVariantMap() << QStringLiteral("close") << refused << 1
+            << QStringList {
+                   QStringLiteral("error code RemoteHostClosedError url: ") + user + QStringLiteral(", error detail: *")
+               } + abandoned.mid(1);
         QTest::newRow("redirect not followed") << 0 << QVariantMap() << QStringLiteral("redirect:/v1/domain/")
                                                << QStringLiteral(R"({"code":302,"data":null,"msg":"moved"})") << 1
                                                << QStringList { notOk + QStringLiteral("302") };
@@ -166,14 +174,21 @@ private Q_SLOTS:
                    + QStringLiteral(", error detail: Operation canceled") }
                 + abandoned.mid(1);
         const QString missing = m_other.filePath(QStringLiteral("missing.pem"));
-        const QString sslError = QStringLiteral("ssl error url: ") + domain + QStringLiteral(" certificate error: *");
-        QTest::newRow("CA file missing: still sent")
-            << 6 << QVariantMap { { QStringLiteral("url/server-cert"), missing } } << QString() << domainReply << 1
+        const QStringList untrusted { QStringLiteral("ssl error url: ") + domain
+            + QStringLiteral(" certificate error: *.     certificate error: *") };
+        QTest::newRow("CA file missing, literal address: nothing sent")
+            << 6 << QVariantMap { { QStringLiteral("url/server-cert"), missing } } << QString() << unreachable << 0
             << QStringList { QStringLiteral("server cert file is not exists. config: ") + missing,
-                   QStringLiteral("cannot set server key."), sslError };
-        QTest::newRow("server not signed by the configured CA")
+                   QStringLiteral("cannot set server key.") };
+        QTest::newRow("server of another CA")
             << 6 << QVariantMap { { QStringLiteral("url/server-cert"), m_other.filePath(QStringLiteral("ca.pem")) } }
-            << QString() << domainReply << 1 << QStringList { sslError + QStringLiteral(".     certificate error: *") };
+            << QString() << unreachable << 0 << untrusted;
+        QTest::newRow("self-signed server")
+            << 6 << QVariantMap() << QStringLiteral("cert:selfsigned") << unreachable << 0 << untrusted;
+        QTest::newRow("expired server certificate")
+            << 6 << QVariantMap() << QStringLiteral("cert:expired") << unreachable << 0 << untrusted;
+        QTest::newRow("no subjectAltName, literal address: taken")
+            << 6 << QVariantMap() << QStringLiteral("cert:nosan") << domainReply << 1 << QStringList();
         QTest::newRow("no client certificate")
             << 6 << QVariantMap { { QStringLiteral("url/public-key"), QVariant() } } << QString() << refused << 0
             << QStringList { QStringLiteral("client public key file is not exists. config: "),
@@ -201,6 +216,10 @@ private Q_SLOTS:
         QFETCH(QStringList, warnings);
         const Operation &operation = everyOperation().at(op);
         QVERIFY(writeSettings(settings));
+        if (behaviour.startsWith(QLatin1String("cert:"))) {
+            QVERIFY(showCertificate(behaviour.mid(5)));
+            behaviour.clear();
+        }
         QVERIFY(m_server.setMisbehaviour(QLatin1String(operation.path), behaviour));
         HttpHelper helper;
         QCOMPARE(operation.call(helper), expected);
@@ -211,6 +230,7 @@ private Q_SLOTS:
             return;
         QJsonObject request = requests.first();
         const QJsonObject headers = request.take(QLatin1String("headers")).toObject();
+        request.remove(QLatin1String("connection"));
         QCOMPARE(request,
             QJsonObject({ { QStringLiteral("method"), QLatin1String(operation.method) },
                 { QStringLiteral("path"), QLatin1String(operation.path) },
@@ -219,6 +239,26 @@ private Q_SLOTS:
         QCOMPARE(headers.value(QLatin1String("content-type")).toString(), QStringLiteral("application/json"));
         QCOMPARE(headers.value(QLatin1String("user-agent")).toString(), QStringLiteral("KEST"));
         QCOMPARE(headers.value(QLatin1String("accept")).toString(), QStringLiteral("application/json"));
+    }
+
+    // Requests share one connection until the TLS files change.
+    void keptConnection()
+    {
+        QVERIFY(writeSettings());
+        HttpHelper helper;
+        for (int i = 0; i < 3; ++i)
+            QCOMPARE(helper.queryDomain(), domainReply);
+        QFile key(m_server.filePath(QStringLiteral("client.key")));
+        QVERIFY(key.open(QIODevice::Append));
+        QVERIFY(key.setFileTime(QDateTime::currentDateTime().addSecs(1), QFileDevice::FileModificationTime));
+        key.close();
+        QCOMPARE(helper.queryDomain(), domainReply);
+        QList<int> connections;
+        for (const QJsonObject &request : m_server.requests())
+            connections << request.value(QLatin1String("connection")).toInt();
+        QCOMPARE(connections.size(), 4);
+        QCOMPARE(connections.mid(0, 3), (QList<int> { connections.first(), connections.first(), connections.first() }));
+        QVERIFY(connections.last() != connections.first());
     }
 
     void withoutSettingsFileNothingIsSent()
@@ -268,6 +308,14 @@ private Q_SLOTS:
     }
 
 private:
+    bool showCertificate(const QString &name)
+    {
+        if (name == m_certificate)
+            return true;
+        m_certificate = name;
+        return m_server.start(m_server.port(), false, name);
+    }
+
     bool writeSettings(QVariantMap overrides = QVariantMap())
     {
         overrides.insert(QStringLiteral("main/domain"), QStringLiteral("kest.test"));
@@ -282,6 +330,7 @@ private:
     TestRoot m_root;
     DomainServerFixture m_server;
     QTemporaryDir m_other;
+    QString m_certificate = QStringLiteral("server");
 };
 
 QTEST_GUILESS_MAIN(HttpHelperTest)

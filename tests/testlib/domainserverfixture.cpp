@@ -45,7 +45,7 @@ bool DomainServerFixture::makeCertificates(const QString &directory, QString *er
     return false;
 }
 
-bool DomainServerFixture::start(quint16 port, bool plain)
+bool DomainServerFixture::start(quint16 port, bool plain, const QString &certificate)
 {
     stop();
     QStringList arguments { QStringLiteral("--address"), address(), QStringLiteral("--port"), QString::number(port),
@@ -54,7 +54,8 @@ bool DomainServerFixture::start(quint16 port, bool plain)
     if (plain)
         arguments << QStringLiteral("--plain");
     else
-        arguments << QStringLiteral("--cert") << pathOf("server.pem") << QStringLiteral("--key") << pathOf("server.key")
+        arguments << QStringLiteral("--cert") << m_dir.filePath(certificate + QStringLiteral(".pem"))
+                  << QStringLiteral("--key") << m_dir.filePath(certificate + QStringLiteral(".key"))
                   << QStringLiteral("--ca") << pathOf("ca.pem");
     m_server.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_server.start(buildPath(QStringLiteral("kest-test-domain-server")), arguments);

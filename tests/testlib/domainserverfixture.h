@@ -20,6 +20,8 @@ public:
 
     // False when the certificates could not be made; errorText() says why.
     bool isValid() const { return m_valid; }
+    // A file of its directory: certificates, keys, data.
+    QString filePath(const QString &name) const { return m_dir.filePath(name); }
     QString errorText() const { return m_error; }
 
     static QString address() { return QStringLiteral("127.0.0.2"); }
@@ -30,7 +32,8 @@ public:
     static bool makeCertificates(const QString &directory, QString *error = nullptr);
 
     // Port 0 lets the server pick a free one; port() tells which. plain: HTTP instead of HTTPS.
-    bool start(quint16 port = 0, bool plain = false);
+    // certificate: which of makeCertificates' server certificates it shows ("server", "selfsigned", ...).
+    bool start(quint16 port = 0, bool plain = false, const QString &certificate = QStringLiteral("server"));
     void stop();
     quint16 port() const { return m_port; }
 

@@ -52,8 +52,8 @@ void DomainServer::incomingConnection(qintptr descriptor)
     // Probes that connect and leave, failed handshakes and finished answers all end here.
     connect(socket, &QTcpSocket::disconnected, socket, &QObject::deleteLater);
     connect(socket, &QTcpSocket::errorOccurred, socket, &QObject::deleteLater);
-    new HttpConnection(
-        socket, [this](HttpConnection *connection, const HttpRequest &request) { handle(connection, request); });
+    new HttpConnection(socket, ++m_connections,
+        [this](HttpConnection *connection, const HttpRequest &request) { handle(connection, request); });
     if (auto *ssl = qobject_cast<QSslSocket *>(socket)) {
         ssl->setSslConfiguration(m_tls);
         ssl->startServerEncryption();
@@ -75,8 +75,8 @@ void DomainServer::handle(HttpConnection *connection, const HttpRequest &request
         connection->close();
         return;
     case Misbehaviour::Kind::Redirect:
-        connection->respond(HttpResponse { 302, R"({"code":302,"msg":"moved","data":null})",
-                                           { { "Location", behaviour.target() } } });
+        connection->respond(
+            HttpResponse { 302, R"({"code":302,"msg":"moved","data":null})", { { "Location", behaviour.target() } } });
         return;
     case Misbehaviour::Kind::Status: {
         HttpResponse response = m_directory.answer(request);
@@ -103,7 +103,8 @@ void DomainServer::logRequest(const HttpConnection *connection, const HttpReques
     const QJsonObject line { { QStringLiteral("method"), QString::fromLatin1(request.method) },
         { QStringLiteral("path"), QString::fromLatin1(request.path) }, { QStringLiteral("headers"), headers },
         { QStringLiteral("body"), QString::fromUtf8(request.body) },
-        { QStringLiteral("client"), connection->clientName() } };
+        { QStringLiteral("client"), connection->clientName() },
+        { QStringLiteral("connection"), connection->serial() } };
     QFile file(m_logFile);
     if (file.open(QIODevice::WriteOnly | QIODevice::Append))
         file.write(QJsonDocument(line).toJson(QJsonDocument::Compact) + '\n');

@@ -32,6 +32,7 @@ private:
     DomainDirectory m_directory;
     QString m_behaviourFile;
     QString m_logFile;
+    int m_connections = 0;
     QSslConfiguration m_tls;
     bool m_useTls = false;
 };

@@ -28,9 +28,10 @@ QByteArray reasonPhrase(int status)
 }
 } // namespace
 
-HttpConnection::HttpConnection(QTcpSocket *socket, const Handler &handler)
+HttpConnection::HttpConnection(QTcpSocket *socket, int serial, const Handler &handler)
     : QObject(socket)
     , m_socket(socket)
+    , m_serial(serial)
     , m_handler(handler)
 {
     connect(socket, &QTcpSocket::readyRead, this, &HttpConnection::readRequest);
@@ -43,11 +44,18 @@ void HttpConnection::respond(const HttpResponse &response)
     m_answered = true;
     QByteArray message = "HTTP/1.1 " + QByteArray::number(response.status) + ' ' + reasonPhrase(response.status)
         + "\r\nContent-Type: application/json\r\nContent-Length: " + QByteArray::number(response.body.size())
-        + "\r\nConnection: close\r\n";
+        + (m_keepAlive ? "\r\nConnection: keep-alive\r\n" : "\r\nConnection: close\r\n");
     for (auto it = response.headers.cbegin(); it != response.headers.cend(); ++it)
         message += it.key() + ": " + it.value() + "\r\n";
     m_socket->write(message + "\r\n" + response.body);
-    m_socket->disconnectFromHost();
+    if (!m_keepAlive) {
+        m_socket->disconnectFromHost();
+        return;
+    }
+    m_parser = HttpRequestParser();
+    m_answered = false;
+    if (m_socket->bytesAvailable() > 0)
+        readRequest();
 }
 
 void HttpConnection::respondLater(int milliseconds, const HttpResponse &response)
@@ -78,12 +86,15 @@ void HttpConnection::readRequest()
     case HttpRequestParser::State::Incomplete:
         return;
     case HttpRequestParser::State::Invalid:
+        m_keepAlive = false;
         respond(HttpResponse { 400, R"({"code":400,"msg":"malformed request","data":null})" });
         return;
     case HttpRequestParser::State::TooLarge:
+        m_keepAlive = false;
         respond(HttpResponse { 413, R"({"code":413,"msg":"request too large","data":null})" });
         return;
     case HttpRequestParser::State::Complete:
+        m_keepAlive = m_parser.request().headers.value("connection").toLower() != "close";
         m_handler(this, m_parser.request());
         return;
     }
