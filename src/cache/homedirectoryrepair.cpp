@@ -5,6 +5,7 @@
 
 #include <QDebug>
 #include <QDir>
+#include <QDirIterator>
 #include <QFileInfo>
 #include <QSet>
 #include <QStringList>
@@ -68,9 +69,11 @@ void HomeDirectoryRepair::walk(const QString &home, uint uid, const QString &use
         if (walked.contains(directory))
             continue;
         walked.insert(directory);
-        const QFileInfoList entries
-            = QDir(directory).entryInfoList(QDir::Dirs | QDir::Files | QDir::NoDotAndDotDot, QDir::NoSort);
-        for (const QFileInfo &entry : entries) {
+        // The iterator keeps the file system's own order; QDir would sort by name even when told not to.
+        QDirIterator entries(directory, QDir::Dirs | QDir::Files | QDir::NoDotAndDotDot);
+        while (entries.hasNext()) {
+            entries.next();
+            const QFileInfo entry = entries.fileInfo();
             const QString parent = entry.absolutePath();
             const QByteArray encoded = QFile::encodeName(parent);
             if (chown(encoded.constData(), uid, homeGroup) != 0)

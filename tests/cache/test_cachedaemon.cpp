@@ -2,6 +2,7 @@
 #include "cachedaemonfixture.h"
 #include "cachestore.h"
 #include "domainserverfixture.h"
+#include "rawconnection.h"
 #include "testroot.h"
 #include "userlistmanager.h"
 
@@ -188,6 +189,56 @@ private Q_SLOTS:
         QCOMPARE(QDir(s->root.workDir()).entryList(QDir::Files), QStringList { QStringLiteral("groups.txt") });
     }
 
+    // An impostor's certificate counts as an unreachable server: nothing it says is used, and the
+    // start-up refresh keeps what is cached.
+    void impostorServer_data()
+    {
+        QTest::addColumn<QString>("certificate");
+        QTest::addColumn<bool>("otherAuthority");
+        QTest::newRow("another CA") << QStringLiteral("server") << true;
+        QTest::newRow("self-signed") << QStringLiteral("selfsigned") << false;
+        QTest::newRow("expired") << QStringLiteral("expired") << false;
+    }
+
+    void impostorServer()
+    {
+        QFETCH(QString, certificate);
+        QFETCH(bool, otherAuthority);
+        QCOMPARE(s->login("@alice", "alice-password"), passTrue);
+        s->daemon.stop();
+        QVERIFY(s->server.start(s->server.port(), false, certificate));
+        QTemporaryDir other;
+        QVariantMap values = settings();
+        if (otherAuthority) {
+            QVERIFY(DomainServerFixture::makeCertificates(other.path()));
+            values.insert(QStringLiteral("url/server-cert"), other.filePath(QStringLiteral("ca.pem")));
+        }
+        QVERIFY(s->root.writeSettings(s->server.settingsIni(values)));
+        QVERIFY2(s->daemon.start(), qPrintable(s->daemon.errorText()));
+        QCOMPARE(s->lookUp("@bob"), passFalse);
+        QCOMPARE(s->lookUp("@alice"), passTrue);
+        QCOMPARE(s->login("@alice", "alice-password"), passTrue);
+        QTest::qWait(1500); // the start-up refresh has run
+        QCOMPARE(QDir(s->root.workDir()).entryList({ QStringLiteral("1*") }), QStringList { QStringLiteral("10001") });
+    }
+
+    // A client that gives up while the server is slow costs only its own answer.
+    void clientLeavesDuringSlowAnswer()
+    {
+        QVERIFY(s->server.setMisbehaviour(QStringLiteral("/v3/account/"), QStringLiteral("delay:1000")));
+        RawConnection leaving(s->daemon.port());
+        leaving.send(CacheDaemonFixture::frame(
+            CacheDaemonFixture::functionCall(QStringLiteral("queryAccountName"), { QStringLiteral("@alice") })));
+        RawConnection waiting(s->daemon.port());
+        waiting.send(CacheDaemonFixture::frame(
+            CacheDaemonFixture::functionCall(QStringLiteral("queryAccountName"), { QStringLiteral("@bob") })));
+        QTest::qWait(200);
+        leaving.abort();
+        QCOMPARE(waiting.reply(10000), passTrue);
+        QVERIFY(s->exists(10001) && s->exists(10002));
+        QVERIFY(s->daemon.isRunning());
+    }
+
     void refreshOnceTheServerIsBack()
     {
         s->daemon.stop();
@@ -279,6 +330,14 @@ private Q_SLOTS:
         QCOMPARE(s->daemon.request(command(4, QStringLiteral("nope"))),
             result("[PasswordConfig] : pw-config json parse error!!!"));
         QCOMPARE(s->daemon.request(command(9, 1)), result("invalid command!!!"));
+        // Any other local user may look up and log in, but not delete caches or rewrite the policy.
+        QCOMPARE(s->daemon.requestAsUser(65534, command(2, QStringLiteral(R"({"whitelist":[]})"))),
+            result("permission denied !!!"));
+        QVERIFY(s->exists(10001));
+        QCOMPARE(s->daemon.requestAsUser(65534, command(4, QStringLiteral("{}"))), result("permission denied !!!"));
+        QCOMPARE(s->daemon.requestAsUser(65534, CacheDaemonFixture::functionCall(QStringLiteral("queryAccountName"),
+                                                    { QStringLiteral("@alice") })),
+            passTrue);
         QCOMPARE(s->call("modifyUser", "[]"), status(1, "json解析失败"));
         QCOMPARE(s->call("modifyUser", R"({"username":"@alice"})"), status(2, "json解析失败,缺少必要的字段"));
     }

@@ -9,6 +9,7 @@
 #include <QJsonObject>
 #include <QTest>
 
+#include <dirent.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -19,6 +20,19 @@ struct stat statOf(const QString &path)
     struct stat info = {};
     stat(QFile::encodeName(path).constData(), &info);
     return info;
+}
+// The names of a directory in the order the file system lists them.
+QStringList listed(const QString &path)
+{
+    QStringList names;
+    DIR *directory = opendir(QFile::encodeName(path).constData());
+    while (const dirent *entry = directory ? readdir(directory) : nullptr) {
+        if (entry->d_name[0] != '.')
+            names << QFile::decodeName(entry->d_name);
+    }
+    if (directory)
+        closedir(directory);
+    return names;
 }
 } // namespace
 
@@ -85,6 +99,25 @@ private Q_SLOTS:
         // The walk changes the directories that hold entries, never the entries themselves.
         for (const QString &entry : qAsConst(entries))
             QCOMPARE(statOf(home + QLatin1Char('/') + entry).st_uid, uid_t(0));
+    }
+
+    // Entries come in the file system's own order, not sorted: a directory listed last leaves its mode.
+    void walkKeepsTheListingOrder()
+    {
+        TestRoot root;
+        GroupListManager groups;
+        UserListManager users(&groups);
+        users.addUser(
+            QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") }, { QStringLiteral("uid"), 10001 } });
+        const QString home = root.filePath(QStringLiteral("/home/@alice"));
+        QVERIFY(QDir().mkpath(home + QStringLiteral("/docs")));
+        for (int i = 0; listed(home).constLast() != QLatin1String("docs"); ++i) {
+            QVERIFY2(i < 50, "no file name the file system lists before docs");
+            QFile::remove(home + QStringLiteral("/z%1.txt").arg(i - 1));
+            QVERIFY(root.writeFile(QStringLiteral("/home/@alice/z%1.txt").arg(i), "x"));
+        }
+        HomeDirectoryRepair::repair(QStringLiteral("@alice"), users);
+        QCOMPARE(statOf(home).st_mode & 07777, mode_t(0x750));
     }
 };
 

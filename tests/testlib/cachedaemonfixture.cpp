@@ -9,6 +9,43 @@
 #include <QTest>
 #include <QtEndian>
 
+#include <arpa/inet.h>
+#include <grp.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace
+{
+// Runs in the forked child: system calls only, no Qt.
+void replyAsUser(uint uid, quint16 port, const QByteArray &frame, int out)
+{
+    if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0)
+        _exit(2);
+    const int fd = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in address {};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(port);
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    const timeval timeout { 20, 0 };
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof(timeout));
+    if (connect(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) != 0
+        || send(fd, frame.constData(), size_t(frame.size()), 0) != frame.size())
+        _exit(3);
+    char buffer[4096];
+    ssize_t received;
+    while ((received = recv(fd, buffer, sizeof(buffer), 0)) > 0) {
+        if (write(out, buffer, size_t(received)) != received)
+            _exit(4);
+        if (received < ssize_t(sizeof(buffer)))
+            break;
+    }
+    _exit(0);
+}
+} // namespace
+
 QString CacheDaemonFixture::programPath()
 {
     return QString::fromLocal8Bit(qgetenv("KEST_TEST_BINARY_DIR")) + QStringLiteral("/src/cache/cache-kest");
@@ -62,4 +99,27 @@ QByteArray CacheDaemonFixture::request(const QByteArray &payload) const
     RawConnection connection(m_port);
     connection.send(frame(payload));
     return connection.reply();
+}
+
+QByteArray CacheDaemonFixture::requestAsUser(uint uid, const QByteArray &payload) const
+{
+    int channel[2];
+    if (pipe(channel) != 0)
+        return QByteArray();
+    const QByteArray framed = frame(payload);
+    const pid_t child = fork();
+    if (child == 0) {
+        close(channel[0]);
+        replyAsUser(uid, m_port, framed, channel[1]);
+    }
+    close(channel[1]);
+    QByteArray reply;
+    char buffer[4096];
+    ssize_t received;
+    while ((received = read(channel[0], buffer, sizeof(buffer))) > 0)
+        reply.append(buffer, int(received));
+    close(channel[0]);
+    if (child > 0)
+        waitpid(child, nullptr, 0);
+    return reply.mid(4);
 }

@@ -27,6 +27,8 @@ public:
     // One request on a new connection; the reply's payload, or a null array when none came in time.
     QByteArray request(const QByteArray &payload) const;
     QByteArray call(const QString &name, const QStringList &argv) const { return request(functionCall(name, argv)); }
+    // The same from a child process running under another user id; the payload of the reply, or empty.
+    QByteArray requestAsUser(uint uid, const QByteArray &payload) const;
 
 private:
     QProcess m_daemon;
