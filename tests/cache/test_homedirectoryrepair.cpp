@@ -111,7 +111,7 @@ private Q_SLOTS:
             QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") }, { QStringLiteral("uid"), 10001 } });
         const QString home = root.filePath(QStringLiteral("/home/@alice"));
         QVERIFY(QDir().mkpath(home + QStringLiteral("/docs")));
-        for (int i = 0; listed(home).constLast() != QLatin1String("docs"); ++i) {
+        for (int i = 0; listed(home).size() < 2 || listed(home).constLast() != QLatin1String("docs"); ++i) {
             QVERIFY2(i < 50, "no file name the file system lists before docs");
             QFile::remove(home + QStringLiteral("/z%1.txt").arg(i - 1));
             QVERIFY(root.writeFile(QStringLiteral("/home/@alice/z%1.txt").arg(i), "x"));
