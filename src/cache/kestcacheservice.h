@@ -39,6 +39,8 @@ public:
     static const int callNetworkBudgetMs = 4000;
 
     static QString passReply(bool pass);
+    // Takes the user object out of a server answer and puts the password's digest (or "x") in it.
+    static bool validateServerAnswer(const QString &reply, const QString &password, QJsonObject &user);
 
 Q_SIGNALS:
     void updateCache();
@@ -56,7 +58,6 @@ private:
     void watchServer();
     bool sleepUnlessStopped();
     void beginCall();
-    static bool validateServerAnswer(const QString &reply, const QString &password, QJsonObject &user);
     static QString statusReply(int code, const QString &message);
     QString answerLookup(
         const QString &reply, bool known, const QString &offlineMessage, const QString &unknownMessage);

@@ -1,0 +1,21 @@
+// Fuzz target: the binary cache record read from a file, and its JSON form.
+#include "cachecontrolfactory.h"
+#include "cachecontrolinterface.h"
+#include "fuzzroot.h"
+
+#include <QJsonDocument>
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
+{
+    const FuzzRoot &root = FuzzRoot::instance();
+    const QString file = QStringLiteral("/var/lib/libkest-iam/10001");
+    if (!root.writeFile(file, data, size))
+        return 0;
+    CacheControlPtr record = createCacheControl();
+    if (record->readFromFile(root.path(file))) {
+        CacheControlPtr copy = createCacheControl();
+        copy->fromJsonString(record->toJsonString(QJsonDocument::Compact));
+    }
+    createCacheControl()->fromJsonString(QString::fromUtf8(reinterpret_cast<const char *>(data), int(size)));
+    return 0;
+}
