@@ -1,6 +1,8 @@
 #include "cachecontrolfactory.h"
 #include "cachedaemonfixture.h"
+#include "blackhole.h"
 #include "cachestore.h"
+#include "common.h"
 #include "domainserverfixture.h"
 #include "rawconnection.h"
 #include "testroot.h"
@@ -89,6 +91,16 @@ struct Setup {
     }
     bool exists(uint uid) const { return QFile::exists(root.workDir() + QLatin1Char('/') + QString::number(uid)); }
 };
+// The way the machine's modules ask: socket_query, with its 5 s receive time-out.
+QByteArray moduleCall(const char *function, const QStringList &argv)
+{
+    const QByteArray frame
+        = CacheDaemonFixture::frame(CacheDaemonFixture::functionCall(QLatin1String(function), argv));
+    unsigned char reply[4096];
+    if (!socket_query(frame.constData(), size_t(frame.size()), reply, sizeof(reply)))
+        return "no answer";
+    return QByteArray(reinterpret_cast<const char *>(reply));
+}
 } // namespace
 
 // The real cache-kest against the test domain server, the way the machine's modules use it.
@@ -237,6 +249,26 @@ private Q_SLOTS:
         QCOMPARE(waiting.reply(10000), passTrue);
         QVERIFY(s->exists(10001) && s->exists(10002));
         QVERIFY(s->daemon.isRunning());
+    }
+
+    // A server whose SYNs go unanswered: the modules' client, which waits 5 s, still gets every answer.
+    void blackholedServer()
+    {
+        QCOMPARE(s->login("@alice", "alice-password"), passTrue);
+        s->server.stop();
+        Blackhole blackhole(DomainServerFixture::address(), s->server.port());
+        QVERIFY(blackhole.isFull());
+        for (int i = 0; i < 3; ++i) {
+            QCOMPARE(moduleCall("queryAccountName", { QStringLiteral("@alice") }), passTrue);
+            QCOMPARE(moduleCall("authenticatePassword", { QStringLiteral("@alice"), QStringLiteral("alice-password") }),
+                passTrue);
+        }
+        blackhole.close();
+        QVERIFY(s->server.start(s->server.port()));
+        QTest::qWait(2500); // the daemon's once-a-second probe
+        s->server.clearRequests();
+        QCOMPARE(moduleCall("queryAccountName", { QStringLiteral("@alice") }), passTrue);
+        QCOMPARE(s->server.requests().size(), 1);
     }
 
     void refreshOnceTheServerIsBack()

@@ -261,6 +261,26 @@ private Q_SLOTS:
         QVERIFY(connections.last() != connections.first());
     }
 
+    // One failed connection starts an outage: later calls answer at once, without a word or a packet,
+    // until a probe reaches the server again.
+    void outage()
+    {
+        const quint16 closed = closedPort();
+        QVERIFY(writeSettings({ { QStringLiteral("main/port"), closed } }));
+        HttpHelper helper;
+        for (int i = 0; i < 3; ++i)
+            QCOMPARE(helper.queryDomain(), unreachable);
+        QCOMPARE(logged({}),
+            QStringList {
+                QStringLiteral("error host address: 127.0.0.2:%1, error detail: Connection refused").arg(closed) });
+        QVERIFY(writeSettings());
+        QCOMPARE(helper.queryDomain(), unreachable);
+        QVERIFY(m_server.requests().isEmpty());
+        QString hostPort;
+        QVERIFY(helper.checkServerAddress(hostPort));
+        QCOMPARE(helper.queryDomain(), domainReply);
+    }
+
     void withoutSettingsFileNothingIsSent()
     {
         QVERIFY(writeSettings() && m_root.removeSettings());
