@@ -17,11 +17,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
     const int piece = data[0] + 1;
     const QByteArray bytes(reinterpret_cast<const char *>(data) + 1, int(size) - 1);
     HttpReplyReader reader(64 * 1024);
-    for (int offset = 0; offset < bytes.size() && reader.state() == HttpReplyReader::State::Incomplete;
-         offset += piece)
+    for (int offset = 0; offset < bytes.size() && reader.state() == HttpReplyReader::State::Incomplete; offset += piece)
         reader.feed(bytes.mid(offset, piece));
     reader.finish();
-    const QString answer = QString::fromUtf8(reader.state() == HttpReplyReader::State::Complete ? reader.body() : bytes);
+    const QString answer
+        = QString::fromUtf8(reader.state() == HttpReplyReader::State::Complete ? reader.body() : bytes);
     QJsonObject user;
     if (!KestCacheService::validateServerAnswer(answer, QStringLiteral("password"), user))
         return 0;

@@ -2,8 +2,8 @@
 // regression test, in builds without libFuzzer.
 #include <QDir>
 #include <QDirIterator>
-#include <QFileInfo>
 #include <QFile>
+#include <QFileInfo>
 
 #include <cstdint>
 #include <cstdio>

@@ -40,7 +40,8 @@ Blackhole::Blackhole(const QString &address, quint16 port)
     m_listener = socket(AF_INET, SOCK_STREAM, 0);
     const int yes = 1;
     setsockopt(m_listener, SOL_SOCKET, SO_REUSEADDR, &yes, sizeof(yes));
-    if (bind(m_listener, reinterpret_cast<const sockaddr *>(&target), sizeof(target)) != 0 || listen(m_listener, 0) != 0)
+    if (bind(m_listener, reinterpret_cast<const sockaddr *>(&target), sizeof(target)) != 0
+        || listen(m_listener, 0) != 0)
         return;
     // A backlog of 0 holds one finished connection; the attempt that no longer completes proves it full.
     for (int &filler : m_fillers) {

@@ -22,6 +22,7 @@ public:
     int stop();
     bool isRunning() const { return m_daemon.state() == QProcess::Running; }
     quint16 port() const { return m_port; }
+    qint64 processId() const { return m_daemon.processId(); }
     QString errorText() const { return m_error; }
 
     // One request on a new connection; the reply's payload, or a null array when none came in time.

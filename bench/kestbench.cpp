@@ -1,0 +1,202 @@
+// kest-bench: latencies of cache-kest against floors measured in the same run (run by tools/bench.sh).
+#include "blackhole.h"
+#include "cachedaemonfixture.h"
+#include "domainserverfixture.h"
+#include "echoserver.h"
+#include "httphelper.h"
+#include "testroot.h"
+
+#include <QCoreApplication>
+#include <QElapsedTimer>
+#include <QFile>
+#include <QTest>
+#include <QTextStream>
+#include <QtEndian>
+
+#include <algorithm>
+#include <functional>
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+namespace
+{
+struct Row {
+    QString name;
+    QList<double> samples; // milliseconds
+    QString floor; // empty: no ratio
+};
+
+double percentile(QList<double> samples, double fraction)
+{
+    if (samples.isEmpty())
+        return 0;
+    std::sort(samples.begin(), samples.end());
+    return samples.at(qMin(samples.size() - 1, int(fraction * samples.size())));
+}
+
+// What the modules' client does for one call: connect, send one frame, read the reply, close.
+bool roundTrip(quint16 port, const QByteArray &frame, QByteArray *reply = nullptr)
+{
+    const int fd = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in address {};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(port);
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    const timeval timeout { 10, 0 };
+    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof(timeout));
+    bool ok = connect(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) == 0
+        && send(fd, frame.constData(), size_t(frame.size()), 0) == frame.size();
+    char buffer[65536];
+    ssize_t have = 0;
+    while (ok) {
+        const ssize_t got = recv(fd, buffer + have, sizeof(buffer) - size_t(have), 0);
+        if (got <= 0) {
+            ok = false;
+            break;
+        }
+        have += got;
+        if (have >= 4 && have >= 4 + ssize_t(qFromBigEndian<quint32>(buffer)))
+            break;
+    }
+    close(fd);
+    if (ok && reply)
+        *reply = QByteArray(buffer + 4, int(have - 4));
+    return ok;
+}
+
+QList<double> measure(int count, const std::function<void()> &action)
+{
+    QList<double> samples;
+    for (int i = 0; i < count; ++i) {
+        QElapsedTimer timer;
+        timer.start();
+        action();
+        samples << double(timer.nsecsElapsed()) / 1e6;
+    }
+    return samples;
+}
+
+QByteArray call(const char *function, const QStringList &argv)
+{
+    return CacheDaemonFixture::frame(CacheDaemonFixture::functionCall(QLatin1String(function), argv));
+}
+
+QString rssOf(qint64 pid)
+{
+    QFile status(QStringLiteral("/proc/%1/status").arg(pid));
+    if (!status.open(QIODevice::ReadOnly))
+        return QStringLiteral("?");
+    for (const QByteArray &line : status.readAll().split('\n')) {
+        if (line.startsWith("VmRSS:"))
+            return QString::fromLatin1(line.mid(6).simplified());
+    }
+    return QStringLiteral("?");
+}
+
+QString machine()
+{
+    QFile cpu(QStringLiteral("/proc/cpuinfo"));
+    QString model = QStringLiteral("unknown CPU");
+    if (cpu.open(QIODevice::ReadOnly)) {
+        for (const QByteArray &line : cpu.readAll().split('\n')) {
+            if (line.startsWith("model name")) {
+                model = QString::fromLatin1(line.mid(line.indexOf(':') + 1).trimmed());
+                break;
+            }
+        }
+    }
+    return model + QStringLiteral(", ") + QString::number(sysconf(_SC_NPROCESSORS_ONLN)) + QStringLiteral(" cores");
+}
+
+void print(const QList<Row> &rows, const QStringList &notes)
+{
+    QTextStream out(stdout);
+    out << "machine: " << machine() << "\n\n";
+    out << "| measurement | p50 ms | p90 ms | floor | p50 / floor | p90 / floor |\n|---|---|---|---|---|---|\n";
+    for (const Row &row : rows) {
+        const double p50 = percentile(row.samples, 0.5);
+        const double p90 = percentile(row.samples, 0.9);
+        out << "| " << row.name << " | " << QString::number(p50, 'f', 3) << " | " << QString::number(p90, 'f', 3)
+            << " | ";
+        const auto floor = std::find_if(rows.begin(), rows.end(), [&](const Row &r) { return r.name == row.floor; });
+        if (floor == rows.end()) {
+            out << "- | - | - |\n";
+            continue;
+        }
+        out << floor->name << " | " << QString::number(p50 / percentile(floor->samples, 0.5), 'f', 2) << " | "
+            << QString::number(p90 / percentile(floor->samples, 0.9), 'f', 2) << " |\n";
+    }
+    for (const QString &note : notes)
+        out << "\n" << note;
+    out << Qt::endl;
+}
+} // namespace
+
+int main(int argc, char *argv[])
+{
+    QCoreApplication application(argc, argv);
+    const int count = 200;
+    TestRoot root;
+    DomainServerFixture server;
+    if (!server.isValid() || !server.start()) {
+        QTextStream(stderr) << "cannot start the test domain server: " << server.errorText() << Qt::endl;
+        return 1;
+    }
+    const QVariantMap settings { { QStringLiteral("main/enable"), true },
+        { QStringLiteral("offline_login/enable"), true }, { QStringLiteral("offline_login/cache_validity"), 7 } };
+    root.writeSettings(server.settingsIni(settings));
+    root.writeFile(QStringLiteral("/usr/share/kest/machine.txt"), "bench-machine\n");
+    CacheDaemonFixture daemon;
+    if (!daemon.start()) {
+        QTextStream(stderr) << "cannot start cache-kest: " << daemon.errorText() << Qt::endl;
+        return 1;
+    }
+    const QString loopback = QStringLiteral("floor: framed loopback round trip");
+    const QString kept = QStringLiteral("floor: HTTPS request, kept-alive connection");
+    const QString fresh = QStringLiteral("floor: HTTPS request, new TLS connection");
+    const QByteArray lookUp = call("queryAccountName", { QStringLiteral("@alice") });
+    const QByteArray login
+        = call("authenticatePassword", { QStringLiteral("@alice"), QStringLiteral("alice-password") });
+    QList<Row> rows;
+
+    EchoServer echo;
+    rows << Row { loopback, measure(count, [&] { roundTrip(echo.port(), lookUp); }), QString() };
+    HttpHelper helper;
+    helper.queryDomain();
+    rows << Row { kept, measure(count, [&] { helper.queryDomain(); }), QString() };
+    rows << Row { fresh, measure(count / 4, [] { HttpHelper().queryDomain(); }), QString() };
+
+    roundTrip(daemon.port(), login);
+    rows << Row { QStringLiteral("look-up, online"), measure(count, [&] { roundTrip(daemon.port(), lookUp); }), kept };
+    rows << Row { QStringLiteral("login, online"), measure(count, [&] { roundTrip(daemon.port(), login); }), kept };
+
+    server.stop();
+    roundTrip(daemon.port(), lookUp);
+    rows << Row { QStringLiteral("look-up, offline"), measure(count, [&] { roundTrip(daemon.port(), lookUp); }),
+        loopback };
+    rows << Row { QStringLiteral("login, offline"), measure(count, [&] { roundTrip(daemon.port(), login); }),
+        loopback };
+    const QString rss = rssOf(daemon.processId());
+
+    // A new outage per daemon start: the first call finds the server silent, the others know it.
+    Row first { QStringLiteral("look-up, server blackholed: first call"), {}, loopback };
+    Row following { QStringLiteral("look-up, server blackholed: following calls"), {}, loopback };
+    Blackhole blackhole(DomainServerFixture::address(), server.port());
+    for (int run = 0; run < 3 && blackhole.isFull(); ++run) {
+        daemon.stop();
+        daemon.start();
+        first.samples << measure(1, [&] { roundTrip(daemon.port(), lookUp); });
+        following.samples << measure(count / 3, [&] { roundTrip(daemon.port(), lookUp); });
+    }
+    rows << first << following;
+    print(rows,
+        { QStringLiteral("cache-kest RSS after the online and offline rows: ") + rss,
+            QStringLiteral("blackholed first call: p50 %1 s over %2 daemon starts")
+                .arg(percentile(first.samples, 0.5) / 1000, 0, 'f', 2)
+                .arg(first.samples.size()) });
+    return 0;
+}
