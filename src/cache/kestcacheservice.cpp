@@ -13,6 +13,7 @@
 #include <QJsonDocument>
 #include <QThread>
 
+#include <algorithm>
 #include <cerrno>
 #include <ctime>
 #include <limits>
@@ -323,7 +324,9 @@ QString KestCacheService::listAccounts()
     if (!isEnabled())
         return passReply(false);
     QJsonArray users;
-    const QList<quint32> uids = listCacheUids();
+    // In uid order, so that a listing reads the same each time.
+    QList<quint32> uids = listCacheUids();
+    std::sort(uids.begin(), uids.end());
     for (const quint32 uid : uids) {
         if (const CacheControlPtr record = shownAccount(uid))
             users.append(accountEntry(*record));

@@ -201,7 +201,7 @@ static enum nss_status find_group(
     char *text = read_group_file();
     if (text == NULL)
         return unavailable(errnop);
-    enum nss_status status = not_found(errnop);
+    enum nss_status status = NSS_STATUS_NOTFOUND;
     struct group_line line;
     for (const char *p = text; *p != '\0';) {
         p = read_line(p, &line);
@@ -211,7 +211,7 @@ static enum nss_status find_group(
         }
     }
     free(text);
-    return status;
+    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_getgrnam_r(const char *name, struct group *grp, char *buffer, size_t buflen, int *errnop)
@@ -281,7 +281,7 @@ enum nss_status _nss_kest_getgrent_r(struct group *grp, char *buffer, size_t buf
     pthread_mutex_lock(&listing_lock);
     if (!listing_taken)
         take_listing();
-    enum nss_status status = not_found(errnop);
+    enum nss_status status = NSS_STATUS_NOTFOUND;
     while (next_line != NULL && *next_line != '\0') {
         struct group_line line;
         const char *after = read_line(next_line, &line);
@@ -296,7 +296,7 @@ enum nss_status _nss_kest_getgrent_r(struct group *grp, char *buffer, size_t buf
         break;
     }
     pthread_mutex_unlock(&listing_lock);
-    return status;
+    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_endgrent(void)

@@ -147,20 +147,17 @@ enum nss_status _nss_kest_getpwent_r(struct passwd *pwd, char *buffer, size_t bu
     if (!listing_taken)
         take_listing();
     enum nss_status status = NSS_STATUS_NOTFOUND;
-    *errnop = ENOENT;
-    while (next_entry != NULL) {
+    while (next_entry != NULL && status == NSS_STATUS_NOTFOUND) {
         status = fill_passwd(next_entry, pwd, buffer, buflen, errnop);
         /* A short buffer keeps the entry for glibc's retry; a malformed one is passed over. */
         if (status == NSS_STATUS_TRYAGAIN)
             break;
         next_entry = json_next(next_entry);
-        if (status == NSS_STATUS_SUCCESS)
-            break;
-        status = NSS_STATUS_NOTFOUND;
-        *errnop = ENOENT;
+        if (status == NSS_STATUS_UNAVAIL)
+            status = NSS_STATUS_NOTFOUND;
     }
     pthread_mutex_unlock(&listing_lock);
-    return status;
+    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_endpwent(void)
