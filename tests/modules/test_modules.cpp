@@ -167,6 +167,11 @@ private Q_SLOTS:
         m_namedCacheKest.start(
             QStringLiteral("bash"), { QStringLiteral("-c"), QStringLiteral("exec -a cache-kest sleep 600") });
         QVERIFY(m_namedCacheKest.waitForStarted());
+        const auto renamed = [pid = m_namedCacheKest.processId()] {
+            QFile cmdline(QStringLiteral("/proc/%1/cmdline").arg(pid));
+            return cmdline.open(QIODevice::ReadOnly) && cmdline.readAll().startsWith("cache-kest");
+        };
+        QTRY_VERIFY(renamed());
     }
 
     void cleanupTestCase()
