@@ -30,6 +30,7 @@ expected=(/etc/kest-iam.conf /usr/bin/cache-kest /usr/sbin/dbus-kest /usr/share/
     "/usr/lib/$multiarch/libkest-iam.so.1" "/usr/lib/$multiarch/pkgconfig/kest-iam.pc"
     /usr/lib/systemd/system/{cache-kest,dbus-kest}.service
     /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf
+    "/usr/lib/$multiarch/libnss_kest.so.2" "/usr/lib/$multiarch/security/pam_kest.so" /usr/share/pam-configs/kest
 )
 for file in "${expected[@]}"; do
     check "package holds $file" grep -qx -- "$file" "$work/files"
