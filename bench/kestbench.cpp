@@ -1,14 +1,17 @@
 // kest-bench: latencies of cache-kest against floors measured in the same run (run by tools/bench.sh).
 #include "blackhole.h"
 #include "cachedaemonfixture.h"
+#include "domainconnection.h"
 #include "domainserverfixture.h"
 #include "echoserver.h"
-#include "httphelper.h"
 #include "testroot.h"
 
 #include <QCoreApplication>
 #include <QElapsedTimer>
 #include <QFile>
+#include <QSslCertificate>
+#include <QSslKey>
+#include <QSslSocket>
 #include <QTest>
 #include <QTextStream>
 #include <QtEndian>
@@ -112,6 +115,29 @@ QString machine()
     return model + QStringLiteral(", ") + QString::number(sysconf(_SC_NPROCESSORS_ONLN)) + QStringLiteral(" cores");
 }
 
+DomainEndpoint endpointOf(const DomainServerFixture &server)
+{
+    DomainEndpoint endpoint;
+    endpoint.address = QHostAddress(DomainServerFixture::address());
+    endpoint.port = server.port();
+    endpoint.tls = true;
+    return endpoint;
+}
+
+// The client's TLS set-up, without the daemon's settings: the floor is the wire and the server alone.
+QSslConfiguration tlsOf(const DomainServerFixture &server)
+{
+    QSslConfiguration tls = QSslConfiguration::defaultConfiguration();
+    tls.setCaCertificates(QSslCertificate::fromPath(server.filePath(QStringLiteral("ca.pem"))));
+    tls.setLocalCertificateChain(QSslCertificate::fromPath(server.filePath(QStringLiteral("client.pem"))));
+    QFile key(server.filePath(QStringLiteral("client.key")));
+    key.open(QIODevice::ReadOnly);
+    tls.setPrivateKey(QSslKey(&key, QSsl::Rsa));
+    tls.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
+    tls.setPeerVerifyMode(QSslSocket::VerifyPeer);
+    return tls;
+}
+
 void print(const QList<Row> &rows, const QStringList &notes)
 {
     QTextStream out(stdout);
@@ -165,10 +191,24 @@ int main(int argc, char *argv[])
 
     EchoServer echo;
     rows << Row { loopback, measure(count, [&] { roundTrip(echo.port(), lookUp); }), QString() };
-    HttpHelper helper;
-    helper.queryDomain();
-    rows << Row { kept, measure(count, [&] { helper.queryDomain(); }), QString() };
-    rows << Row { fresh, measure(count / 4, [] { HttpHelper().queryDomain(); }), QString() };
+    const DomainEndpoint endpoint = endpointOf(server);
+    const QSslConfiguration tls = tlsOf(server);
+    const QByteArray request = "GET /v1/domain/ HTTP/1.1\r\nHost: " + DomainServerFixture::address().toUtf8() + ':'
+        + QByteArray::number(server.port()) + "\r\nContent-Length: 0\r\n\r\n";
+    DomainConnection connection;
+    connection.setEndpoint(endpoint, tls);
+    const auto exchange
+        = [&request](DomainConnection &over) { over.exchange(request, QDeadlineTimer(5000), QDeadlineTimer(5000)); };
+    exchange(connection);
+    rows << Row { kept, measure(count, [&] { exchange(connection); }), QString() };
+    rows << Row { fresh,
+        measure(count / 4,
+            [&] {
+                DomainConnection once;
+                once.setEndpoint(endpoint, tls);
+                exchange(once);
+            }),
+        QString() };
 
     roundTrip(daemon.port(), login);
     rows << Row { QStringLiteral("look-up, online"), measure(count, [&] { roundTrip(daemon.port(), lookUp); }), kept };

@@ -1,11 +1,10 @@
 #include "cachecontrolfactory.h"
 
 #include "cachecontrol_1_0.h"
-#include "kestpaths.h"
+#include "settingsfile.h"
 
 #include <QFile>
 #include <QJsonObject>
-#include <QSettings>
 #include <QtEndian>
 
 namespace
@@ -47,10 +46,8 @@ quint32 cacheVersionOfFile(const QString &path)
 
 quint32 cacheValiditySeconds()
 {
-    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    settings.beginGroup(QStringLiteral("offline_login"));
-    const quint32 days = settings.value(QStringLiteral("cache_validity"), 0u).toUInt();
-    settings.endGroup();
+    const quint32 days
+        = SettingsFile::value(QStringLiteral("offline_login"), QStringLiteral("cache_validity"), 0u).toUInt();
     // Wraps above 49710 days on purpose.
     return days * kSecondsPerDay;
 }

@@ -1,20 +1,15 @@
 #include "offlinelogin.h"
 
 #include "cachestore.h"
-#include "kestpaths.h"
+#include "settingsfile.h"
 
 #include <QDebug>
-#include <QSettings>
 
 namespace
 {
 bool offlineLoginEnabled()
 {
-    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    settings.beginGroup(QStringLiteral("offline_login"));
-    const bool enabled = settings.value(QStringLiteral("enable"), false).toBool();
-    settings.endGroup();
-    return enabled;
+    return SettingsFile::value(QStringLiteral("offline_login"), QStringLiteral("enable"), false).toBool();
 }
 
 // A record that cannot be read counts as an empty one: never marked, never effective.

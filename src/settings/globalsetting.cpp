@@ -1,6 +1,7 @@
 #include "globalsetting.h"
 
 #include "kestpaths.h"
+#include "settingsfile.h"
 
 #include <QDebug>
 #include <QFile>
@@ -14,7 +15,8 @@ struct GlobalSettingOwner {
     std::unique_ptr<GlobalSetting> object { new GlobalSetting };
 };
 
-namespace {
+namespace
+{
 const QString mainGroup = QStringLiteral("main");
 const QString urlGroup = QStringLiteral("url");
 const QString passwdGroup = QStringLiteral("passwd");
@@ -22,11 +24,7 @@ const QString groupGroup = QStringLiteral("group");
 
 QVariant readValue(const QString &group, const QString &key, const QVariant &defaultValue)
 {
-    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    settings.beginGroup(group);
-    const QVariant value = settings.value(key, defaultValue);
-    settings.endGroup();
-    return value;
+    return SettingsFile::value(group, key, defaultValue);
 }
 
 GlobalSettingOwner owner;
@@ -141,13 +139,14 @@ QString GlobalSetting::serverCert() const
 
 QString GlobalSetting::privateKey() const
 {
-    return readExistingPath(QStringLiteral("private-key"),
-                            QStringLiteral("client private key file is not exists. config: "));
+    return readExistingPath(
+        QStringLiteral("private-key"), QStringLiteral("client private key file is not exists. config: "));
 }
 
 QString GlobalSetting::publicKey() const
 {
-    return readExistingPath(QStringLiteral("public-key"), QStringLiteral("client public key file is not exists. config: "));
+    return readExistingPath(
+        QStringLiteral("public-key"), QStringLiteral("client public key file is not exists. config: "));
 }
 
 int GlobalSetting::port() const
