@@ -241,6 +241,35 @@ private Q_SLOTS:
         QCOMPARE(headers.value(QLatin1String("accept")).toString(), QStringLiteral("application/json"));
     }
 
+    // A server given by IPv6 address, or by a host name that its certificate must then name.
+    void addressForms_data()
+    {
+        QTest::addColumn<QString>("listen");
+        QTest::addColumn<QString>("ip");
+        QTest::addColumn<QString>("certificate");
+        QTest::addColumn<QString>("expected");
+        QTest::newRow("IPv6 literal") << QStringLiteral("::1") << QStringLiteral("::1") << QStringLiteral("server")
+                                      << domainReply;
+        QTest::newRow("host name") << QStringLiteral("127.0.0.1") << QStringLiteral("localhost")
+                                   << QStringLiteral("server") << domainReply;
+        QTest::newRow("host name the certificate lacks")
+            << QStringLiteral("127.0.0.1") << QStringLiteral("localhost") << QStringLiteral("nosan") << unreachable;
+    }
+
+    void addressForms()
+    {
+        QFETCH(QString, listen);
+        QFETCH(QString, ip);
+        QFETCH(QString, certificate);
+        m_server.setListenAddress(listen);
+        QVERIFY(m_server.start(0, false, certificate));
+        m_certificate.clear(); // the next init() starts the usual server again
+        QVERIFY(writeSettings({ { QStringLiteral("main/ip"), ip } }));
+        HttpHelper helper;
+        QTEST(helper.queryDomain(), "expected");
+        m_server.setListenAddress(DomainServerFixture::address());
+    }
+
     // Requests share one connection until the TLS files change.
     void keptConnection()
     {

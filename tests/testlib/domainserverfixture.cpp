@@ -48,7 +48,7 @@ bool DomainServerFixture::makeCertificates(const QString &directory, QString *er
 bool DomainServerFixture::start(quint16 port, bool plain, const QString &certificate)
 {
     stop();
-    QStringList arguments { QStringLiteral("--address"), address(), QStringLiteral("--port"), QString::number(port),
+    QStringList arguments { QStringLiteral("--address"), m_listen, QStringLiteral("--port"), QString::number(port),
         QStringLiteral("--data"), pathOf("data.json"), QStringLiteral("--behaviour"), pathOf("behaviour.json"),
         QStringLiteral("--log"), pathOf("requests.log") };
     if (plain)
@@ -60,7 +60,7 @@ bool DomainServerFixture::start(quint16 port, bool plain, const QString &certifi
     m_server.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_server.start(buildPath(QStringLiteral("kest-test-domain-server")), arguments);
     // The server's one line on standard output names the port it listens on.
-    const QByteArray prefix = "listening on " + address().toLatin1() + ':';
+    const QByteArray prefix = "listening on " + m_listen.toLatin1() + ':';
     const QDeadlineTimer deadline(15000);
     while (!m_server.canReadLine() && m_server.waitForReadyRead(static_cast<int>(deadline.remainingTime()))) { }
     const QByteArray line = m_server.readLine().trimmed();
@@ -118,7 +118,7 @@ bool DomainServerFixture::clearRequests()
 
 QByteArray DomainServerFixture::settingsIni(const QVariantMap &overrides) const
 {
-    QMap<QString, QVariant> values { { QStringLiteral("main/ip"), address() }, { QStringLiteral("main/port"), m_port },
+    QMap<QString, QVariant> values { { QStringLiteral("main/ip"), m_listen }, { QStringLiteral("main/port"), m_port },
         { QStringLiteral("main/network-timeout"), 5 }, { QStringLiteral("url/server-cert"), pathOf("ca.pem") },
         { QStringLiteral("url/public-key"), pathOf("client.pem") },
         { QStringLiteral("url/private-key"), pathOf("client.key") } };

@@ -25,6 +25,8 @@ public:
     QString errorText() const { return m_error; }
 
     static QString address() { return QStringLiteral("127.0.0.2"); }
+    // Where the next start listens (a loopback address; address() unless told otherwise).
+    void setListenAddress(const QString &listen) { m_listen = listen; }
     // alice (10001, "alice-password", sudo) and bob (10002, "bob-password") in group kest (10000),
     // a group "staff" (10010) with alice, and the domain "kest.test".
     static QJsonObject defaultData();
@@ -58,5 +60,6 @@ private:
     QProcess m_server;
     QString m_error;
     quint16 m_port = 0;
+    QString m_listen = address();
     bool m_valid = false;
 };
