@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # A local demonstration of kest-iam: the bundled test domain server, cache-kest and dbus-kest run in
 # a temporary root on a private system bus, and a network account is looked up, logs in online and
-# offline, is seen over D-Bus and changes its password. Touches nothing of the machine's own state.
+# offline (also through getent, id and pamtester with the modules), is seen over D-Bus and changes
+# its password. Touches nothing of the machine's own state.
 #   tools/demo.sh                      build if needed, then run
 #   KEST_BUILD_DIR=DIR tools/demo.sh   use the programs already built in DIR (CI)
 set -euo pipefail
@@ -14,6 +15,7 @@ if [ -z "${KEST_BUILD_DIR:-}" ]; then
     echo "== building in $build"
     cmake -S "$top" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
     cmake --build "$build" --parallel "$(nproc)" --target cache-kest dbus-kest kest-test-domain-server kest-query \
+        nss_kest pam_kest \
         | grep -v '^\[' || true
 else
     build=$KEST_BUILD_DIR
@@ -27,6 +29,10 @@ cache_kest="$build/src/cache/cache-kest"
 dbus_kest="$build/src/dbus-service/dbus-kest"
 domain_server="$build/tools/test-domain-server/kest-test-domain-server"
 query="$build/tools/kest-query/kest-query"
+nss_module="$build/src/modules/libnss_kest.so.2"
+pam_module="$build/src/modules/pam_kest.so"
+# A sanitizer build's modules need the sanitizer's runtime in the programs that load them.
+sanitizer=$(ldd "$nss_module" | awk '/libasan/ {print $3}')
 
 work=$(mktemp -d /tmp/kest-demo.XXXXXX)
 pids=()
@@ -75,6 +81,30 @@ export KEST_IAM_ROOT="$work/root"
 mkdir -p "$KEST_IAM_ROOT"/{etc,var/lib/libkest-iam,run,home,usr/share/kest}
 echo "demo-machine-0001" >"$KEST_IAM_ROOT/usr/share/kest/machine.txt"
 export PATH="$(dirname "$cache_kest"):$PATH"
+
+# getent, id and pamtester with the modules, through the wrappers: the machine's own passwd, group
+# and PAM files are neither read nor changed.
+mkdir -p "$work/wrapped"
+echo "root:x:0:0:root:/root:/bin/bash" >"$work/wrapped/passwd"
+printf 'root:x:0:\nkest:x:10000:\n' >"$work/wrapped/group"
+for type in auth account password session; do echo "$type required $pam_module"; done >"$work/wrapped/kest"
+: >"$work/wrapped/other"
+wrapped() { # wrapped WRAPPER COMMAND...
+    env ASAN_OPTIONS=detect_leaks=0 LD_PRELOAD="${sanitizer:+$sanitizer }$1" ${sanitizer:+NSS_WRAPPER_DISABLE_DEEPBIND=1} \
+        NSS_WRAPPER_PASSWD="$work/wrapped/passwd" NSS_WRAPPER_GROUP="$work/wrapped/group" \
+        NSS_WRAPPER_MODULE_SO_PATH="$nss_module" NSS_WRAPPER_MODULE_FN_PREFIX=kest \
+        PAM_WRAPPER=1 PAM_WRAPPER_SERVICE_DIR="$work/wrapped" "${@:2}" 2>&1
+}
+glibc_view() {
+    show "getent passwd @alice"
+    expect "getent" "@alice:x:10001:10000:Alice Liddell:/home/@alice:/bin/bash" \
+        "$(wrapped libnss_wrapper.so getent passwd @alice)"
+    show "id @alice"
+    expect_match "id" "^uid=10001\(@alice\) gid=10000\(kest\)" "$(wrapped libnss_wrapper.so id @alice)"
+    show "pamtester kest @alice authenticate"
+    expect_match "PAM login" "successfully authenticated" \
+        "$(echo alice-password | wrapped libpam_wrapper.so pamtester kest @alice authenticate)"
+}
 
 step "Certificates for the domain server and this machine"
 "$top/tools/make-test-certs.sh" "$work/certs"
@@ -167,6 +197,7 @@ show "cache-kest --show-cache 10001"
 record=$("$cache_kest" --show-cache 10001)
 sed 's/^/   | /' <<<"$record"
 expect_match "cache record" "^account: @alice$" "$(grep account <<<"$record")"
+glibc_view
 
 step "The domain server goes away"
 kill "$domain_pid"
@@ -174,6 +205,7 @@ wait "$domain_pid" 2>/dev/null || true
 expect "look-up from the cache" '{"pass":true}' "$("$query" queryAccountName @alice)"
 expect "offline login with the right password" '{"pass":true}' "$("$query" authenticatePassword @alice alice-password)"
 expect "offline login with a wrong password" '{"pass":false}' "$("$query" authenticatePassword @alice guess)"
+glibc_view
 
 step "dbus-kest, the front service, on the private bus"
 "$dbus_kest" &
