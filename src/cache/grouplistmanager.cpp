@@ -3,6 +3,7 @@
 #include "cache-common.h"
 #include "common.h"
 #include "kestpaths.h"
+#include "wholefile.h"
 
 #include <QDebug>
 #include <QFile>
@@ -93,15 +94,7 @@ void GroupListManager::loadGroups()
 
 void GroupListManager::saveGroups()
 {
-    QFile file(KestPaths::groupsFile());
-    if (!file.open(QIODevice::ReadWrite | QIODevice::Truncate | QIODevice::Text)) {
-        qWarning().noquote() << QStringLiteral("cannot write groups file. ");
-        return;
-    }
-    file.setPermissions(
-        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
-    QTextStream stream(&file);
-    stream.setCodec("UTF-8");
+    QString text;
     for (const GroupEntryPtr &entry : qAsConst(m_groups)) {
         if (entry->name.isEmpty() || entry->name == placeholderName)
             continue;
@@ -111,11 +104,12 @@ void GroupListManager::saveGroups()
         // Short member texts keep their trailing comma: name-service readers split keeping empty parts.
         if (members.size() > 6)
             members.chop(1);
-        stream
-            << QStringLiteral("%1:%2:%3:%4\n").arg(entry->name, entry->password, QString::number(entry->gid), members);
+        text += QStringLiteral("%1:%2:%3:%4\n").arg(entry->name, entry->password, QString::number(entry->gid), members);
     }
-    stream.flush();
-    file.flush();
+    QString error;
+    if (!WholeFile::write(KestPaths::groupsFile(), text.toUtf8(),
+            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error))
+        qWarning().noquote() << QStringLiteral("cannot write groups file. ");
 }
 
 bool GroupListManager::lookupSystemGroup(const QString &name, GroupEntry &entry) const

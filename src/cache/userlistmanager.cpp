@@ -6,6 +6,7 @@
 #include "grouplistmanager.h"
 #include "httphelper.h"
 #include "kestpaths.h"
+#include "wholefile.h"
 
 #include <QCryptographicHash>
 #include <QDateTime>
@@ -161,24 +162,18 @@ void UserListManager::addUser(const QJsonObject &user)
 
 void UserListManager::saveSpecials(const UserEntryPtr &entry)
 {
-    QFile file(KestPaths::specialsFile());
-    if (!file.open(QIODevice::ReadWrite | QIODevice::Truncate | QIODevice::Text)) {
-        qWarning().noquote() << QStringLiteral("open specials file failed. ") + file.errorString();
-    } else {
-        file.setPermissions(
-            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
-        QTextStream stream(&file);
-        stream.setCodec("UTF-8");
-        for (const UserEntryPtr &user : qAsConst(m_users)) {
-            if (isValidDomainAccountName(user->name))
-                continue;
-            stream << QStringLiteral("%1:%2:%3:%4:%5:%6:%7\n")
-                          .arg(user->name, user->password, QString::number(user->uid), QString::number(user->gid),
-                              user->gecos, user->home, user->shell);
-        }
-        stream.flush();
-        file.close();
+    QString text;
+    for (const UserEntryPtr &user : qAsConst(m_users)) {
+        if (isValidDomainAccountName(user->name))
+            continue;
+        text += QStringLiteral("%1:%2:%3:%4:%5:%6:%7\n")
+                    .arg(user->name, user->password, QString::number(user->uid), QString::number(user->gid),
+                        user->gecos, user->home, user->shell);
     }
+    QString error;
+    if (!WholeFile::write(KestPaths::specialsFile(), text.toUtf8(),
+            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error))
+        qWarning().noquote() << QStringLiteral("open specials file failed. ") + error;
 
     if (!entry)
         return;
@@ -201,8 +196,12 @@ void UserListManager::writeCacheRecord(const UserEntry &entry) const
     record->setHomePath(entry.home);
     record->setLoginShell(entry.shell);
     // The offline-login window runs from the last online login, which a refresh must not reset.
-    if (const CacheControlPtr previous = loadRecord(entry.uid))
+    const CacheControlPtr previous = loadRecord(entry.uid);
+    if (previous) {
         record->setLastLoginTime(previous->lastLoginTime());
+        if (previous->toJsonString(QJsonDocument::Compact) == record->toJsonString(QJsonDocument::Compact))
+            return;
+    }
     saveCacheRecord(*record);
 }
 
