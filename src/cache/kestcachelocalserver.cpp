@@ -192,6 +192,8 @@ bool KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &fram
         return false;
     }
     socket->write(framed);
+    // Out now: the client is waiting, and the event loop would send it only on its next turn.
+    socket->flush();
     return true;
 }
 

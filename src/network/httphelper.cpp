@@ -4,10 +4,8 @@
 #include "kestpaths.h"
 #include "serverreachability.h"
 
-#include <QDateTime>
 #include <QDebug>
 #include <QFile>
-#include <QFileInfo>
 #include <QHostAddress>
 #include <QJsonArray>
 #include <QJsonParseError>
@@ -22,6 +20,7 @@
 
 #include <initializer_list>
 #include <memory>
+#include <sys/stat.h>
 #include <utility>
 
 namespace
@@ -60,9 +59,11 @@ QString hostPortText(const QString &address, int port)
 // Names the TLS files as they are now, so that an edited or replaced file rebuilds the configuration.
 QString fileStamp(const QString &path)
 {
-    const QFileInfo info(path);
-    return path + QLatin1Char('@') + QString::number(info.lastModified().toMSecsSinceEpoch()) + QLatin1Char('/')
-        + QString::number(info.size());
+    struct stat info = {};
+    stat(QFile::encodeName(path).constData(), &info);
+    return path + QLatin1Char('@') + QString::number(info.st_mtim.tv_sec) + QLatin1Char('.')
+        + QString::number(info.st_mtim.tv_nsec) + QLatin1Char('/') + QString::number(info.st_size) + QLatin1Char('/')
+        + QString::number(info.st_ino);
 }
 
 QByteArray requestText(const QString &path, const QString &hostPort, const QByteArray &method, const QByteArray &body)
