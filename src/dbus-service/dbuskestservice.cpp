@@ -66,7 +66,10 @@ DBusKestService::DBusKestService(const QDBusConnection &connection, QObject *par
         cleanDomainUserCacheFiles();
 }
 
-DBusKestService::~DBusKestService() = default;
+DBusKestService::~DBusKestService()
+{
+    clearUserObjects();
+}
 
 void DBusKestService::watchLoginSessions()
 {
@@ -160,9 +163,14 @@ void DBusKestService::switchToGreeter()
 bool DBusKestService::registerUserObjects(QDBusConnection connection)
 {
     const UidList uids = GetUserIdList();
+    if (uids.isEmpty())
+        return true;
+    // One user list, read once from the cache store, serves every object of the round.
+    GroupListManager groups;
+    const UserListManager users(&groups);
     for (const uint uid : uids) {
         const auto user = QSharedPointer<DBusKestServiceUser>::create();
-        user->load(uid);
+        user->load(uid, users);
         m_users.insert(uid, user);
         const QString path = kUserObjectPath + QString::number(uid);
         qDebug().noquote() << QStringLiteral("uid=") + QString::number(uid) + QStringLiteral("userPath=") + path;
@@ -173,6 +181,21 @@ bool DBusKestService::registerUserObjects(QDBusConnection connection)
         }
     }
     return true;
+}
+
+// The bus connection keeps its paths in sorted arrays and answers each registered object's destruction with a
+// blocking walk over all of them: taken off the bus last path first and unwatched, many objects go in linear time.
+void DBusKestService::clearUserObjects()
+{
+    for (auto user = m_users.cend(); user != m_users.cbegin();) {
+        --user;
+        const QString path = kUserObjectPath + QString::number(user.key());
+        if (m_connection.objectRegisteredAt(path) != user.value().data())
+            continue;
+        m_connection.unregisterObject(path);
+        QObject::disconnect(user.value().data(), &QObject::destroyed, nullptr, nullptr);
+    }
+    m_users.clear();
 }
 
 void DBusKestService::controlCacheService(bool enable)
@@ -242,7 +265,7 @@ bool DBusKestService::RemoveCacheFilesNotInList(const UidList &whiteList)
 bool DBusKestService::RemoveAllCacheFiles()
 {
     removeAllCacheFiles();
-    m_users.clear();
+    clearUserObjects();
     if (isEnabled())
         syncLoginSessions();
     return true;
@@ -295,7 +318,7 @@ void DBusKestService::SessionNew(const QString &sessionName, const QDBusObjectPa
         qDebug().noquote() << QStringLiteral("no need rescan logined users for session change event.");
         return;
     }
-    m_users.clear();
+    clearUserObjects();
     registerUserObjects(m_connection);
 }
 

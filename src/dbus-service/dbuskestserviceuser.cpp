@@ -1,7 +1,5 @@
 #include "dbuskestserviceuser.h"
 
-#include "grouplistmanager.h"
-
 #include <QDebug>
 
 DBusKestServiceUser::DBusKestServiceUser(QObject *parent)
@@ -9,10 +7,8 @@ DBusKestServiceUser::DBusKestServiceUser(QObject *parent)
 {
 }
 
-void DBusKestServiceUser::load(uint uid)
+void DBusKestServiceUser::load(uint uid, const UserListManager &users)
 {
-    GroupListManager groups;
-    const UserListManager users(&groups);
     const UserEntryPtr entry = users.entryOfUid(uid);
     if (!entry) {
         qWarning().noquote() << QStringLiteral("There is no user that the id is uid.");
