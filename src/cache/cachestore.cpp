@@ -4,6 +4,7 @@
 
 #include <QDebug>
 #include <QDir>
+#include <QDirIterator>
 #include <QFile>
 #include <QFileInfo>
 #include <QRegularExpression>
@@ -126,9 +127,11 @@ QStringList listCacheFiles()
     if (!workDirExists())
         return paths;
     static const QRegularExpression recordName(QStringLiteral("/\\d+$"));
-    const QFileInfoList entries = regularFiles();
-    for (const QFileInfo &entry : entries) {
-        const QString path = entry.absoluteFilePath();
+    // Walked, not listed: a large store never holds the file information of every record at once.
+    QDirIterator entries(workDir(), QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot);
+    while (entries.hasNext()) {
+        entries.next();
+        const QString path = entries.fileInfo().absoluteFilePath();
         if (recordName.match(path).hasMatch())
             paths.append(path);
     }

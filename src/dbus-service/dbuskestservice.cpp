@@ -20,6 +20,9 @@
 #include <QProcess>
 #include <QSettings>
 
+#include <algorithm>
+#include <functional>
+
 namespace
 {
 const uint kFirstDomainUid = 10000;
@@ -183,18 +186,21 @@ bool DBusKestService::registerUserObjects(QDBusConnection connection)
     return true;
 }
 
-// The bus connection keeps its paths in sorted arrays and answers each registered object's destruction with a
-// blocking walk over all of them: taken off the bus last path first and unwatched, many objects go in linear time.
 void DBusKestService::clearUserObjects()
 {
-    for (auto user = m_users.cend(); user != m_users.cbegin();) {
-        --user;
+    QStringList paths;
+    for (auto user = m_users.cbegin(); user != m_users.cend(); ++user) {
         const QString path = kUserObjectPath + QString::number(user.key());
         if (m_connection.objectRegisteredAt(path) != user.value().data())
             continue;
-        m_connection.unregisterObject(path);
+        // Else the connection answers each destruction with a blocking walk over all its paths.
         QObject::disconnect(user.value().data(), &QObject::destroyed, nullptr, nullptr);
+        paths.append(path);
     }
+    // The connection keeps its paths in sorted arrays: taken off from the end, each goes in constant time.
+    std::sort(paths.begin(), paths.end(), std::greater<QString>());
+    for (const QString &path : qAsConst(paths))
+        m_connection.unregisterObject(path);
     m_users.clear();
 }
 
