@@ -4,6 +4,7 @@
 
 #include <QDebug>
 #include <QDir>
+#include <QDirIterator>
 #include <QFile>
 #include <QFileInfo>
 #include <QRegularExpression>
@@ -28,6 +29,21 @@ bool workDirExists()
 QFileInfoList regularFiles()
 {
     return QDir(workDir()).entryInfoList(QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot, QDir::Unsorted);
+}
+
+bool holdsAccount(quint32 uid, const QString &account)
+{
+    CacheControlPtr record = createCacheControl();
+    record->setUid(uid);
+    loadCacheRecord(record);
+    return record && record->account() == account;
+}
+
+// Under the rules of the listing, so that a known uid finds nothing the listing would skip.
+bool isRecordFile(quint32 uid)
+{
+    const QFileInfo file(cacheFilePathOfUid(uid));
+    return file.isFile() && !file.isSymLink();
 }
 
 bool isDomainUserFileName(const QString &name)
@@ -111,9 +127,11 @@ QStringList listCacheFiles()
     if (!workDirExists())
         return paths;
     static const QRegularExpression recordName(QStringLiteral("/\\d+$"));
-    const QFileInfoList entries = regularFiles();
-    for (const QFileInfo &entry : entries) {
-        const QString path = entry.absoluteFilePath();
+    // Walked, not listed: a large store never holds the file information of every record at once.
+    QDirIterator entries(workDir(), QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot);
+    while (entries.hasNext()) {
+        entries.next();
+        const QString path = entries.fileInfo().absoluteFilePath();
         if (recordName.match(path).hasMatch())
             paths.append(path);
     }
@@ -137,21 +155,20 @@ QList<quint32> listCacheUids()
     return uids;
 }
 
-bool findCacheUidByAccount(const QString &account, quint32 &uid)
+bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid)
 {
     uid = 0;
+    if (knownUid != 0 && isRecordFile(knownUid) && holdsAccount(knownUid, account)) {
+        uid = knownUid;
+        return true;
+    }
     const QStringList paths = listCacheFiles();
     for (const QString &path : paths) {
         const quint32 candidate = uidOfCacheFilePath(path);
-        if (!path.endsWith(QString::number(candidate)))
+        if (!path.endsWith(QString::number(candidate)) || !holdsAccount(candidate, account))
             continue;
-        CacheControlPtr record = createCacheControl();
-        record->setUid(candidate);
-        loadCacheRecord(record);
-        if (record && record->account() == account) {
-            uid = candidate;
-            return true;
-        }
+        uid = candidate;
+        return true;
     }
     return false;
 }

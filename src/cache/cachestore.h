@@ -24,7 +24,8 @@ bool cacheRecordFromJson(CacheControlPtr &record, const QString &json);
 quint32 uidOfCacheFilePath(const QString &path);
 QStringList listCacheFiles();
 QList<quint32> listCacheUids();
-bool findCacheUidByAccount(const QString &account, quint32 &uid);
+// The file of knownUid, where the caller's user list has the account, is looked at before the whole store.
+bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid = 0);
 void removeCacheFile(quint32 uid);
 void removeAllCacheFiles();
 // Hands every domain user's record file to root, then deletes it.

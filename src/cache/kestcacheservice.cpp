@@ -255,7 +255,8 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
     beginCall();
     const QString reply = m_http->authenticate(username, password, QStringLiteral("password"));
     if (reply == HttpHelper::unreachableReply()) {
-        if (!checkOfflineLogin(username) || !m_users->checkOfflinePassword(username, password))
+        if (!checkOfflineLogin(username, m_users->uidOfName(username))
+            || !m_users->checkOfflinePassword(username, password))
             return passReply(false);
         qInfo().noquote() << QStringLiteral("[authenticatePassword]: Offline login verification successful");
         return passReply(true);

@@ -23,10 +23,10 @@ CacheControlPtr loadedRecord(quint32 uid)
 } // namespace
 
 // The order of the tests decides which single warning a refusal leaves.
-bool checkOfflineLogin(const QString &account)
+bool checkOfflineLogin(const QString &account, quint32 knownUid)
 {
     quint32 uid = 0;
-    if (!findCacheUidByAccount(account, uid)) {
+    if (!findCacheUidByAccount(account, uid, knownUid)) {
         qWarning().noquote() << QStringLiteral("[checkOfflineLogin]: Cache file not found");
         return false;
     }

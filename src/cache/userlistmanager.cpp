@@ -14,7 +14,6 @@
 #include <QFile>
 #include <QJsonArray>
 #include <QJsonDocument>
-#include <QTextStream>
 
 #include <cctype>
 #include <limits>
@@ -54,6 +53,12 @@ CacheControlPtr loadRecord(uint uid)
     return record;
 }
 
+// The record just loaded answers: loading its file again could only differ while the file is being rewritten.
+bool isMarkedForRemoval(const CacheControlInterface &record)
+{
+    return record.removeStatus() != 0;
+}
+
 // A server answer whose user object is missing means the server no longer vouches for the account.
 bool userObjectOf(const QString &reply, QJsonObject &user)
 {
@@ -83,7 +88,7 @@ void UserListManager::loadUsersFromCache()
         // An unreadable record would enter the passwd side as uid 0 with no name: never list it.
         if (!record || record->uid() != uid || record->account().isEmpty())
             continue;
-        if (isMarkedForRemoval(uid))
+        if (isMarkedForRemoval(*record))
             continue;
         auto entry = UserEntryPtr::create();
         entry->uid = record->uid();
@@ -97,15 +102,15 @@ void UserListManager::loadUsersFromCache()
     }
 }
 
-bool UserListManager::isMarkedForRemoval(uint uid) const
-{
-    const CacheControlPtr record = loadRecord(uid);
-    return record && record->removeStatus() != 0;
-}
-
 void UserListManager::appendUser(const UserEntryPtr &entry)
 {
     m_users.append(entry);
+    if (!m_byName.contains(entry->name))
+        m_byName.insert(entry->name, entry);
+    if (!m_byUid.contains(entry->uid))
+        m_byUid.insert(entry->uid, entry);
+    if (!isValidDomainAccountName(entry->name))
+        m_specials.append(entry);
 }
 
 void UserListManager::addUser(const QJsonObject &user)
@@ -163,13 +168,10 @@ void UserListManager::addUser(const QJsonObject &user)
 void UserListManager::saveSpecials(const UserEntryPtr &entry)
 {
     QString text;
-    for (const UserEntryPtr &user : qAsConst(m_users)) {
-        if (isValidDomainAccountName(user->name))
-            continue;
+    for (const UserEntryPtr &user : qAsConst(m_specials))
         text += QStringLiteral("%1:%2:%3:%4:%5:%6:%7\n")
                     .arg(user->name, user->password, QString::number(user->uid), QString::number(user->gid),
                         user->gecos, user->home, user->shell);
-    }
     QString error;
     if (!WholeFile::write(KestPaths::specialsFile(), text.toUtf8(),
             QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error))
@@ -251,6 +253,9 @@ void UserListManager::rebuildUsers(HttpHelper *helper)
 void UserListManager::clearUsers()
 {
     m_users.clear();
+    m_byName.clear();
+    m_byUid.clear();
+    m_specials.clear();
 }
 
 QList<UserEntryPtr> UserListManager::users() const
@@ -260,11 +265,7 @@ QList<UserEntryPtr> UserListManager::users() const
 
 UserEntryPtr UserListManager::findByName(const QString &name) const
 {
-    for (const UserEntryPtr &entry : m_users) {
-        if (entry->name == name)
-            return entry;
-    }
-    return UserEntryPtr();
+    return m_byName.value(name);
 }
 
 bool UserListManager::hasUserName(const QString &name) const
@@ -285,11 +286,7 @@ uint UserListManager::uidOfName(const QString &name) const
 
 UserEntryPtr UserListManager::entryOfUid(uint uid) const
 {
-    for (const UserEntryPtr &entry : m_users) {
-        if (entry->uid == uid)
-            return entry;
-    }
-    return UserEntryPtr();
+    return m_byUid.value(uid);
 }
 
 bool UserListManager::checkOfflinePassword(const QString &name, const QString &password) const

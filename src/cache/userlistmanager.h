@@ -1,5 +1,6 @@
 #pragma once
 
+#include <QHash>
 #include <QJsonObject>
 #include <QList>
 #include <QObject>
@@ -55,9 +56,14 @@ public:
 private:
     UserEntryPtr findByName(const QString &name) const;
     void appendUser(const UserEntryPtr &entry);
-    bool isMarkedForRemoval(uint uid) const;
     void writeCacheRecord(const UserEntry &entry) const;
 
     GroupListManager *m_groups;
     QList<UserEntryPtr> m_users;
+    // The first entry of each name and uid in list order, so that a look-up answers as a walk of the list
+    // would. A listed entry never changes its name or uid, which keeps both valid until the list is emptied.
+    QHash<QString, UserEntryPtr> m_byName;
+    QHash<uint, UserEntryPtr> m_byUid;
+    // The entries the specials file lists, in list order.
+    QList<UserEntryPtr> m_specials;
 };

@@ -20,6 +20,9 @@
 #include <QProcess>
 #include <QSettings>
 
+#include <algorithm>
+#include <functional>
+
 namespace
 {
 const uint kFirstDomainUid = 10000;
@@ -71,7 +74,10 @@ DBusKestService::DBusKestService(const QDBusConnection &connection, QObject *par
         cleanDomainUserCacheFiles();
 }
 
-DBusKestService::~DBusKestService() = default;
+DBusKestService::~DBusKestService()
+{
+    clearUserObjects();
+}
 
 void DBusKestService::watchLoginSessions()
 {
@@ -165,9 +171,14 @@ void DBusKestService::switchToGreeter()
 bool DBusKestService::registerUserObjects(QDBusConnection connection)
 {
     const UidList uids = GetUserIdList();
+    if (uids.isEmpty())
+        return true;
+    // One user list, read once from the cache store, serves every object of the round.
+    GroupListManager groups;
+    const UserListManager users(&groups);
     for (const uint uid : uids) {
         const auto user = QSharedPointer<DBusKestServiceUser>::create();
-        user->load(uid);
+        user->load(uid, users);
         m_users.insert(uid, user);
         const QString path = kUserObjectPath + QString::number(uid);
         qDebug().noquote() << QStringLiteral("uid=") + QString::number(uid) + QStringLiteral("userPath=") + path;
@@ -178,6 +189,24 @@ bool DBusKestService::registerUserObjects(QDBusConnection connection)
         }
     }
     return true;
+}
+
+void DBusKestService::clearUserObjects()
+{
+    QStringList paths;
+    for (auto user = m_users.cbegin(); user != m_users.cend(); ++user) {
+        const QString path = kUserObjectPath + QString::number(user.key());
+        if (m_connection.objectRegisteredAt(path) != user.value().data())
+            continue;
+        // Else the connection answers each destruction with a blocking walk over all its paths.
+        QObject::disconnect(user.value().data(), &QObject::destroyed, nullptr, nullptr);
+        paths.append(path);
+    }
+    // The connection keeps its paths in sorted arrays: taken off from the end, each goes in constant time.
+    std::sort(paths.begin(), paths.end(), std::greater<QString>());
+    for (const QString &path : qAsConst(paths))
+        m_connection.unregisterObject(path);
+    m_users.clear();
 }
 
 void DBusKestService::controlCacheService(bool enable)
@@ -247,7 +276,7 @@ bool DBusKestService::RemoveCacheFilesNotInList(const UidList &whiteList)
 bool DBusKestService::RemoveAllCacheFiles()
 {
     removeAllCacheFiles();
-    m_users.clear();
+    clearUserObjects();
     if (isEnabled())
         syncLoginSessions();
     return true;
@@ -301,7 +330,7 @@ void DBusKestService::SessionNew(const QString &sessionName, const QDBusObjectPa
         qDebug().noquote() << QStringLiteral("no need rescan logined users for session change event.");
         return;
     }
-    m_users.clear();
+    clearUserObjects();
     registerUserObjects(m_connection);
 }
 

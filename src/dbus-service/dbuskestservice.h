@@ -51,6 +51,7 @@ public Q_SLOTS:
 
 private:
     void watchLoginSessions();
+    void clearUserObjects();
     void syncLoginSessions();
     void killSession(const QString &sessionId);
     void writeEnableSetting(bool enable) const;

@@ -1,7 +1,5 @@
 #include "dbuskestserviceuser.h"
 
-#include "grouplistmanager.h"
-
 #include <QDBusConnection>
 #include <QDBusConnectionInterface>
 #include <QDBusMessage>
@@ -26,10 +24,8 @@ DBusKestServiceUser::DBusKestServiceUser(QObject *parent)
 {
 }
 
-void DBusKestServiceUser::load(uint uid)
+void DBusKestServiceUser::load(uint uid, const UserListManager &users)
 {
-    GroupListManager groups;
-    const UserListManager users(&groups);
     const UserEntryPtr entry = users.entryOfUid(uid);
     if (!entry) {
         qWarning().noquote() << QStringLiteral("There is no user that the id is uid.");

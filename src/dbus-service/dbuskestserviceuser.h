@@ -23,8 +23,8 @@ class DBusKestServiceUser : public QDBusVirtualObject
 public:
     explicit DBusKestServiceUser(QObject *parent = nullptr);
 
-    // Takes the user list entry of the uid; keeps the previous entry when there is none.
-    void load(uint uid);
+    // Takes the entry of the uid from the user list; keeps the previous entry when there is none.
+    void load(uint uid, const UserListManager &users);
 
     // An object without an entry is still published, so every read answers 0 or empty text then.
     uint uid() const;

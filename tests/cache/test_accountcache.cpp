@@ -198,6 +198,9 @@ private Q_SLOTS:
         QVERIFY(findCacheUidByAccount(QStringLiteral("@bob"), uid) && uid == 20002);
         QVERIFY(!findCacheUidByAccount(QStringLiteral("@Alice"), uid) && uid == 0);
         QVERIFY(!findCacheUidByAccount(QStringLiteral("@backup"), uid) && uid == 0);
+        // A known uid is looked at first, under the rules of the listing.
+        QVERIFY(findCacheUidByAccount(QStringLiteral("@bob"), uid, 10001) && uid == 20002);
+        QVERIFY(!findCacheUidByAccount(QStringLiteral("@backup"), uid, 10003) && uid == 0);
 
         ::cleanDomainUserCacheFiles();
         QCOMPARE(sorted(listCacheFiles()), (QStringList { at("999"), at("9999") }));

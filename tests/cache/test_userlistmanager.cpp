@@ -118,18 +118,26 @@ private Q_SLOTS:
         QCOMPARE(record(10001)->password(), digest);
         QCOMPARE(record(10001)->lastLoginTime(), login);
         QVERIFY(groups.groupsOfUser(alice).contains(QStringLiteral("users")));
+
+        // A new name for a listed uid is listed after it: the uid still finds the first entry.
+        users.addUser(user(QStringLiteral("@alice2"), 10001));
+        QCOMPARE(users.entryOfUid(10001)->name, alice);
+        QCOMPARE(users.uidOfName(QStringLiteral("@alice2")), 10001u);
     }
 
     void loadsFromCache()
     {
         TestRoot root;
-        QVERIFY(writeRecord(10001, "@alice") && writeRecord(10002, "@gone", 1));
+        QVERIFY(writeRecord(10001, "@alice") && writeRecord(10002, "@gone", 1) && writeRecord(10003, "@alice"));
         // A record of only the version reads back as uid 0 without a name: never listed.
         QVERIFY(root.writeFile(QStringLiteral("/var/lib/libkest-iam/10004"), QByteArray("\x00\x00\x00\x01", 4)));
         GroupListManager groups;
         UserListManager users(&groups);
-        QCOMPARE(users.users().size(), 1);
+        QCOMPARE(users.users().size(), 2);
         QCOMPARE(users.entryOfUid(10001)->shell, QStringLiteral("/bin/zsh"));
+        QVERIFY(!users.hasUserName(QStringLiteral("@gone")) && !users.hasUid(10002));
+        // Of two records of one name, the first listed answers.
+        QCOMPARE(users.uidOfName(QStringLiteral("@alice")), users.users().first()->uid);
     }
 
     void rebuildAgainstTheDomainServer()
@@ -146,8 +154,9 @@ private Q_SLOTS:
         users.rebuildUsers(&http);
         QCOMPARE(SyslogCapture::matching("abnormal user, remove cache now. user: ").size(), 1);
         QCOMPARE(SyslogCapture::count("abnormal user, remove cache now. user: @ghost"), 1);
-        QVERIFY(!record(10099));
+        QVERIFY(!record(10099) && !users.hasUserName(QStringLiteral("@ghost")));
         QCOMPARE(users.users().size(), 1);
+        QCOMPARE(root.readFile(QStringLiteral("/var/lib/libkest-iam/specials.txt")), QByteArray());
         QCOMPARE(record(10001)->gecos(), QStringLiteral("Alice"));
         QVERIFY(users.checkOfflinePassword(QStringLiteral("@alice"), QStringLiteral("secret")));
 

@@ -198,18 +198,23 @@ private Q_SLOTS:
 
     void userObjects()
     {
-        QStringList read;
-        for (const char *property : { "Uid", "Gid", "UserName", "Password", "HomeDir", "Shell", "Gecos" })
-            read.append(userProperty(10002, property).toString());
-        QCOMPARE(read.join(QLatin1Char('|')),
-            QStringLiteral("10002|10102|@bob|digest-of-@bob|/home/remote/@bob|/bin/zsh|Full Name of @bob"));
+        const auto entry = [this](uint uid) {
+            QStringList read;
+            for (const char *property : { "Uid", "Gid", "UserName", "Password", "HomeDir", "Shell", "Gecos" })
+                read.append(userProperty(uid, property).toString());
+            return read.join(QLatin1Char('|'));
+        };
+        const QString bob
+            = QStringLiteral("10002|10102|@bob|digest-of-@bob|/home/remote/@bob|/bin/zsh|Full Name of @bob");
+        QCOMPARE(entry(10002), bob);
         // A record marked for removal has no user list entry: its object reads as zero and empty text.
         QVERIFY(writeRecord(10003, QStringLiteral("@carol"), 1));
         announce("c3");
         QVERIFY(!userProperty(10003, "Uid").isValid());
         announce("c4");
-        QCOMPARE(userProperty(10003, "Uid"), QVariant(0u));
-        QCOMPARE(userProperty(10003, "UserName"), QVariant(QString()));
+        QCOMPARE(entry(10003), QStringLiteral("0|0|||||"));
+        QCOMPARE(entry(10002), bob);
+        QCOMPARE(entry(10001).section(QLatin1Char('|'), 0, 2), QStringLiteral("10001|10101|@alice"));
         QVERIFY(m_root.writeSettings(kOff));
         announce("c1");
         for (const uint uid : { 10001u, 10002u, 10003u })
