@@ -1,19 +1,33 @@
 // kest-bench: latencies of cache-kest against floors measured in the same run (run by tools/bench.sh).
 #include "blackhole.h"
+#include "cachecontrolfactory.h"
+#include "cachecontrolinterface.h"
 #include "cachedaemonfixture.h"
+#include "cachestore.h"
 #include "domainconnection.h"
 #include "domainserverfixture.h"
 #include "echoserver.h"
+#include "logindstandin.h"
+#include "privatebus.h"
 #include "testroot.h"
+#include "userlistmanager.h"
 
 #include <QCoreApplication>
+#include <QDBusConnection>
+#include <QDBusMessage>
+#include <QDBusObjectPath>
+#include <QDateTime>
 #include <QElapsedTimer>
 #include <QFile>
+#include <QProcess>
 #include <QSslCertificate>
 #include <QSslKey>
 #include <QSslSocket>
+#include <QTcpServer>
+#include <QTemporaryDir>
 #include <QTest>
 #include <QTextStream>
+#include <QThread>
 #include <QtEndian>
 
 #include <algorithm>
@@ -172,6 +186,111 @@ QList<Row> moduleRows(const QString &floor)
     return rows;
 }
 
+quint16 freePort()
+{
+    QTcpServer probe;
+    return probe.listen(QHostAddress::LocalHost) ? probe.serverPort() : 0;
+}
+
+bool writeRecords(int count, uint firstUid)
+{
+    const QString digest = UserListManager::passwordDigest(QStringLiteral("pw"));
+    const QString json = QStringLiteral(R"({"version":16777216,"uid":%1,"main_gid":10000,"account":"@user%1",)"
+                                        R"("home_path":"/home/@user%1","login_shell":"/bin/bash","gecos":"User %1",)"
+                                        R"("password":"%2","last_login_time":%3})");
+    for (int i = 0; i < count; ++i) {
+        CacheControlPtr record;
+        if (!cacheRecordFromJson(record,
+                json.arg(
+                    QString::number(firstUid + uint(i)), digest, QString::number(QDateTime::currentSecsSinceEpoch())))
+            || !saveCacheRecord(*record))
+            return false;
+    }
+    return true;
+}
+
+QDBusMessage userUid(uint uid)
+{
+    return QDBusMessage::createMethodCall(QStringLiteral("com.nimbal.kest.iam"),
+               QStringLiteral("/com/nimbal/kest/iam/user") + QString::number(uid),
+               QStringLiteral("org.freedesktop.DBus.Properties"), QStringLiteral("Get"))
+        << QStringLiteral("com.nimbal.kest.iam.user") << QStringLiteral("Uid");
+}
+
+// dbus-kest from its start until the last per-user object answers, then logind's SessionNew.
+QList<Row> frontServiceRows(int count, uint lastUid, QStringList &notes)
+{
+    const QString label = QStringLiteral(" (%1 records)").arg(count);
+    PrivateBus bus;
+    LogindStandIn logind;
+    if (!bus.isRunning() || !logind.begin(bus.address())) {
+        QTextStream(stderr) << "no private bus or logind stand-in: " << bus.errorText() << Qt::endl;
+        return {};
+    }
+    const QString connectionName = QStringLiteral("bench-%1").arg(count);
+    QDBusConnection connection = QDBusConnection::connectToBus(bus.address(), connectionName);
+    QTemporaryDir guard;
+    QProcess front;
+    QProcessEnvironment environment = QProcessEnvironment::systemEnvironment();
+    environment.insert(QStringLiteral("TMPDIR"), guard.path());
+    front.setProcessEnvironment(environment);
+    QElapsedTimer timer;
+    timer.start();
+    front.start(
+        qEnvironmentVariable("KEST_TEST_BINARY_DIR") + QStringLiteral("/src/dbus-service/dbus-kest"), QStringList());
+    while (connection.call(userUid(lastUid), QDBus::Block, 1000).type() != QDBusMessage::ReplyMessage
+        && timer.elapsed() < 120000 && front.state() != QProcess::NotRunning)
+        QThread::msleep(5);
+    QList<Row> rows { { QStringLiteral("dbus-kest start until the last per-user object answers") + label,
+        { double(timer.nsecsElapsed()) / 1e6 }, QString() } };
+    QDBusMessage session = QDBusMessage::createMethodCall(QStringLiteral("com.nimbal.kest.iam"),
+        QStringLiteral("/com/nimbal/kest/iam"), QStringLiteral("com.nimbal.kest.iam"), QStringLiteral("SessionNew"));
+    session << QStringLiteral("c1")
+            << QVariant::fromValue(QDBusObjectPath(QStringLiteral("/org/freedesktop/login1/session/c1")));
+    rows << Row { QStringLiteral("dbus-kest SessionNew") + label,
+        measure(5, [&] { connection.call(session, QDBus::Block, 120000); }), QString() };
+    notes << QStringLiteral("dbus-kest RSS with %1 records: ").arg(count) + rssOf(front.processId());
+    front.terminate();
+    front.waitForFinished(30000);
+    QDBusConnection::disconnectFromBus(connectionName);
+    return rows;
+}
+
+// Both daemons over many cached accounts; the server is never reachable here.
+QList<Row> scaleRows(int count, const QString &floor, QStringList &notes)
+{
+    const uint firstUid = 20000;
+    TestRoot root;
+    const quint16 port = freePort();
+    root.writeSettings("[main]\nenable=true\nip=127.0.0.2\nport=" + QByteArray::number(port)
+        + "\n[offline_login]\nenable=true\ncache_validity=30\n");
+    if (!writeRecords(count, firstUid))
+        return {};
+    const QList<quint32> listed = listCacheUids();
+    const uint last = listed.isEmpty() ? firstUid : listed.last();
+    QList<Row> rows = frontServiceRows(count, last, notes);
+
+    const QString label = QStringLiteral(" (last of %1 records)").arg(count);
+    CacheDaemonFixture daemon;
+    QElapsedTimer timer;
+    timer.start();
+    const QByteArray group = call("queryGid", { QStringLiteral("1000"), QStringLiteral("{}") });
+    if (!daemon.start() || !roundTrip(daemon.port(), group))
+        return rows;
+    rows << Row { QStringLiteral("cache-kest start until it answers (%1 records)").arg(count),
+        { double(timer.nsecsElapsed()) / 1e6 }, QString() };
+    const QString name = QStringLiteral("@user") + QString::number(last);
+    const QByteArray lookUp = call("queryAccountName", { name });
+    const QByteArray login = call("authenticatePassword", { name, QStringLiteral("pw") });
+    roundTrip(daemon.port(), lookUp);
+    rows << Row { QStringLiteral("look-up, offline") + label, measure(200, [&] { roundTrip(daemon.port(), lookUp); }),
+        floor };
+    rows << Row { QStringLiteral("login, offline") + label, measure(200, [&] { roundTrip(daemon.port(), login); }),
+        floor };
+    notes << QStringLiteral("cache-kest RSS with %1 records: ").arg(count) + rssOf(daemon.processId());
+    return rows;
+}
+
 void print(const QList<Row> &rows, const QStringList &notes)
 {
     QTextStream out(stdout);
@@ -268,10 +387,13 @@ int main(int argc, char *argv[])
         following.samples << measure(count / 3, [&] { roundTrip(daemon.port(), lookUp); });
     }
     rows << first << following;
-    print(rows,
-        { QStringLiteral("cache-kest RSS after the online and offline rows: ") + rss,
-            QStringLiteral("blackholed first call: p50 %1 s over %2 daemon starts")
-                .arg(percentile(first.samples, 0.5) / 1000, 0, 'f', 2)
-                .arg(first.samples.size()) });
+    daemon.stop();
+    QStringList notes { QStringLiteral("cache-kest RSS after the online and offline rows: ") + rss,
+        QStringLiteral("blackholed first call: p50 %1 s over %2 daemon starts")
+            .arg(percentile(first.samples, 0.5) / 1000, 0, 'f', 2)
+            .arg(first.samples.size()) };
+    for (const int count : { 1000, 10000 })
+        rows << scaleRows(count, loopback, notes);
+    print(rows, notes);
     return 0;
 }
