@@ -101,10 +101,15 @@ units_enabled_not_started() {
         && ! grep -q "deb-systemd-invoke start" "$work/control/postinst"
 }
 check "units enabled on installation, not started" units_enabled_not_started
-for key in enable ip port network-timeout domain entryption home protocol user auth group reset_password \
-    server-cert public-key private-key length-limit buffer-limit member-count-limit cache_validity; do
-    check "sample settings list $key" grep -q "^;$key=" "$work/root/etc/kest-iam.conf"
-done
+settings_list_keys() {
+    local key missing=()
+    for key in enable ip port network-timeout domain entryption home protocol user auth group reset_password \
+        server-cert public-key private-key length-limit buffer-limit member-count-limit cache_validity; do
+        grep -q "^;$key=" "$work/root/etc/kest-iam.conf" || missing+=("$key")
+    done
+    [ ${#missing[@]} -eq 0 ] || { echo "missing: ${missing[*]}"; return 1; }
+}
+check "sample settings list every key" settings_list_keys
 check "activation file names the unit" grep -qx "SystemdService=dbus-kest.service" \
     "$work/root/usr/share/dbus-1/system-services/com.nimbal.kest.iam.service"
 
