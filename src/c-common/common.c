@@ -8,6 +8,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <stdarg.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -240,20 +241,27 @@ static int set_timeout(int socket, int option)
     return setsockopt(socket, SOL_SOCKET, option, &timeout, sizeof(timeout));
 }
 
-static int fail_query(int socket, int line, const char *format)
+static int fail_query(const char *function, int socket, int line, const char *format)
 {
     int code = errno;
-    log_message(3, SOURCE_PATH, line, "socket_query", format, code, strerror(code));
+    log_message(3, SOURCE_PATH, line, function, format, code, strerror(code));
     if (socket >= 0)
         close(socket);
     return 0;
 }
 
-int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
+static int fail_connection(const char *function, int socket, int line, const char *format)
+{
+    fail_query(function, socket, line, format);
+    return -1;
+}
+
+/* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
+static int send_query(const char *function, const void *request, size_t request_length)
 {
     int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
-        return fail_query(-1, 288, "socket init failed, code: %d, detail: %s");
+        return fail_connection(function, -1, 288, "socket init failed, code: %d, detail: %s");
 
     struct sockaddr_in address;
     memset(&address, 0, sizeof(address));
@@ -261,28 +269,35 @@ int socket_query(const void *request, size_t request_length, unsigned char *repl
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     unsigned short port = 0;
     if (!pid_file_exists() || !read_port(&port))
-        return fail_query(fd, 297, "read port failed, code: %d, detail: %s");
+        return fail_connection(function, fd, 297, "read port failed, code: %d, detail: %s");
     address.sin_port = htons(port);
 
     if (connect(fd, (struct sockaddr *)&address, sizeof(address)) != 0)
-        return fail_query(fd, 303, "connect socket failed, code: %d, detail: %s");
+        return fail_connection(function, fd, 303, "connect socket failed, code: %d, detail: %s");
     if (!is_connect(fd)) {
         close(fd);
-        return 0;
+        return -1;
     }
 
     set_timeout(fd, SO_SNDTIMEO);
     if (send(fd, request, request_length, MSG_NOSIGNAL) < 0)
-        return fail_query(fd, 313, "send message failed, code: %d, detail: %s");
-
+        return fail_connection(function, fd, 313, "send message failed, code: %d, detail: %s");
     set_timeout(fd, SO_RCVTIMEO);
+    return fd;
+}
+
+int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
+{
+    int fd = send_query("socket_query", request, request_length);
+    if (fd < 0)
+        return 0;
     ssize_t received = recv(fd, reply, reply_capacity, 0);
     if (received < 0)
-        return fail_query(fd, 319, "receive message failed, code: %d, detail: %s");
+        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
     if (received < 4) {
         /* A peer that closes before a whole length prefix arrived sent no reply. */
         errno = received == 0 ? ECONNRESET : EPROTO;
-        return fail_query(fd, 319, "receive message failed, code: %d, detail: %s");
+        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
     }
 
     uint32_t prefix;
@@ -294,6 +309,83 @@ int socket_query(const void *request, size_t request_length, unsigned char *repl
     memmove(reply, reply + 4, body);
     memset(reply + body, 0, reply_capacity - body);
     close(fd);
+    return 1;
+}
+
+static long milliseconds_until(const struct timespec *deadline)
+{
+    struct timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return (deadline->tv_sec - now.tv_sec) * 1000 + (deadline->tv_nsec - now.tv_nsec) / 1000000;
+}
+
+/* Fills buffer with exactly length bytes, or fails with errno set once the deadline has passed. */
+static int receive_all(int fd, unsigned char *buffer, size_t length, const struct timespec *deadline)
+{
+    size_t got = 0;
+    while (got < length) {
+        long wait = milliseconds_until(deadline);
+        if (wait <= 0) {
+            errno = ETIMEDOUT;
+            return 0;
+        }
+        struct pollfd ready = { fd, POLLIN, 0 };
+        int polled = poll(&ready, 1, (int)wait);
+        if (polled < 0 && errno != EINTR)
+            return 0;
+        if (polled <= 0)
+            continue;
+        ssize_t received = recv(fd, buffer + got, length - got, MSG_DONTWAIT);
+        if (received == 0) {
+            errno = ECONNRESET;
+            return 0;
+        }
+        if (received < 0 && errno != EINTR && errno != EAGAIN)
+            return 0;
+        if (received > 0)
+            got += (size_t)received;
+    }
+    return 1;
+}
+
+int socket_query_frame(
+    const void *request, size_t request_length, char **reply, size_t *reply_length, size_t max_length)
+{
+    static const char function[] = "socket_query_frame";
+    static const char failed[] = "receive message failed, code: %d, detail: %s";
+    if (reply == NULL)
+        return 0;
+    *reply = NULL;
+    int fd = send_query(function, request, request_length);
+    if (fd < 0)
+        return 0;
+
+    /* However many segments the reply takes, all of it must come within one receive time-out. */
+    struct timespec deadline;
+    clock_gettime(CLOCK_MONOTONIC, &deadline);
+    deadline.tv_sec += QUERY_TIMEOUT_SECONDS;
+    uint32_t prefix;
+    if (!receive_all(fd, (unsigned char *)&prefix, sizeof(prefix), &deadline))
+        return fail_query(function, fd, __LINE__, failed);
+    size_t length = ntohl(prefix);
+    if (length > max_length) {
+        errno = EMSGSIZE;
+        return fail_query(function, fd, __LINE__, failed);
+    }
+    char *body = malloc(length + 1);
+    if (body == NULL)
+        return fail_query(function, fd, __LINE__, failed);
+    if (!receive_all(fd, (unsigned char *)body, length, &deadline)) {
+        int code = errno;
+        free(body);
+        errno = code;
+        return fail_query(function, fd, __LINE__, failed);
+    }
+    body[length] = '\0';
+    close(fd);
+    *reply = body;
+    if (reply_length != NULL)
+        *reply_length = length;
     return 1;
 }
 

@@ -31,6 +31,9 @@ const FunctionSpec functions[] = {
     { "queryGid", 2 },
     { "authenticatePassword", 2 },
     { "modifyUser", 1 },
+    { "getAccountByName", 1 },
+    { "getAccountByUid", 1 },
+    { "listAccounts", 0 },
 };
 
 QString compact(const QJsonObject &object)
@@ -212,6 +215,12 @@ QString KestCacheLocalServer::callService(const QString &name, const QStringList
         return m_service->authenticatePassword(arguments.at(0), arguments.at(1));
     if (name == QLatin1String("modifyUser"))
         return m_service->modifyUser(arguments.at(0));
+    if (name == QLatin1String("getAccountByName"))
+        return m_service->getAccountByName(arguments.at(0));
+    if (name == QLatin1String("getAccountByUid"))
+        return m_service->getAccountByUid(arguments.at(0).toUInt());
+    if (name == QLatin1String("listAccounts"))
+        return m_service->listAccounts();
     return QString();
 }
 

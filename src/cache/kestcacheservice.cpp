@@ -9,9 +9,11 @@
 #include "userlistmanager.h"
 
 #include <QDebug>
+#include <QJsonArray>
 #include <QJsonDocument>
 #include <QThread>
 
+#include <algorithm>
 #include <cerrno>
 #include <ctime>
 #include <limits>
@@ -38,6 +40,38 @@ void sleepOneSecond()
 {
     struct timespec remaining = { 1, 0 };
     while (nanosleep(&remaining, &remaining) != 0 && errno == EINTR) { }
+}
+
+// The record of a network account that the machine may show: readable, of a domain uid, not marked for removal.
+CacheControlPtr shownAccount(uint uid)
+{
+    if (uid < firstDomainUid)
+        return CacheControlPtr();
+    CacheControlPtr record = createCacheControl();
+    record->setUid(uid);
+    if (!loadCacheRecord(record) || !record || record->uid() != uid || record->account().isEmpty()
+        || record->removeStatus() != 0)
+        return CacheControlPtr();
+    return record;
+}
+
+QJsonObject accountEntry(const CacheControlInterface &record)
+{
+    return { { QStringLiteral("name"), record.account() }, { QStringLiteral("uid"), qint64(record.uid()) },
+        { QStringLiteral("gid"), qint64(record.mainGid()) }, { QStringLiteral("gecos"), record.gecos() },
+        { QStringLiteral("home"), record.homePath() }, { QStringLiteral("shell"), record.loginShell() } };
+}
+
+QString compactReply(const QJsonObject &object)
+{
+    return QString::fromUtf8(QJsonDocument(object).toJson(QJsonDocument::Compact));
+}
+
+QString accountReply(const CacheControlPtr &record)
+{
+    if (!record)
+        return KestCacheService::passReply(false);
+    return compactReply({ { QStringLiteral("pass"), true }, { QStringLiteral("user"), accountEntry(*record) } });
 }
 } // namespace
 
@@ -268,6 +302,36 @@ QString KestCacheService::modifyUser(QString json)
     else
         m_users->addUser(user);
     return reply;
+}
+
+QString KestCacheService::getAccountByName(QString name)
+{
+    if (!isEnabled())
+        return passReply(false);
+    const CacheControlPtr record = shownAccount(m_users->uidOfName(name));
+    return accountReply(record && record->account() == name ? record : CacheControlPtr());
+}
+
+QString KestCacheService::getAccountByUid(uint uid)
+{
+    if (!isEnabled())
+        return passReply(false);
+    return accountReply(shownAccount(uid));
+}
+
+QString KestCacheService::listAccounts()
+{
+    if (!isEnabled())
+        return passReply(false);
+    QJsonArray users;
+    // In uid order, so that a listing reads the same each time.
+    QList<quint32> uids = listCacheUids();
+    std::sort(uids.begin(), uids.end());
+    for (const quint32 uid : uids) {
+        if (const CacheControlPtr record = shownAccount(uid))
+            users.append(accountEntry(*record));
+    }
+    return compactReply({ { QStringLiteral("pass"), true }, { QStringLiteral("users"), users } });
 }
 
 QString KestCacheService::changePassword(

@@ -38,6 +38,10 @@ public Q_SLOTS:
     QString queryGid(uint gid, QString baseJson);
     QString authenticatePassword(QString username, QString password);
     QString modifyUser(QString json);
+    // Entries for the name-service module, from the cache records alone; never a password.
+    QString getAccountByName(QString name);
+    QString getAccountByUid(uint uid);
+    QString listAccounts();
     void onUpdateCache();
 
 private:

@@ -123,6 +123,9 @@ private Q_SLOTS:
         QCOMPARE(loadRecord(10001)->password(), QStringLiteral("x"));
         QCOMPARE(s->login("@alice", "alice-password"), passTrue);
         QCOMPARE(loadRecord(10001)->password(), UserListManager::passwordDigest(QStringLiteral("alice-password")));
+        // The name-service module's entry comes from the cache and never carries the digest.
+        QCOMPARE(s->call("getAccountByName", "@alice"),
+            R"({"pass":true,"user":{"gecos":"Alice","gid":10000,"home":"/home/alice","name":"@alice","shell":"/bin/bash","uid":10001}})");
         QVERIFY(loadRecord(10001)->lastLoginTime() + 60 >= quint64(QDateTime::currentSecsSinceEpoch()));
         struct stat info;
         QCOMPARE(stat(QFile::encodeName(home).constData(), &info), 0);
@@ -163,6 +166,7 @@ private Q_SLOTS:
         alice->setRemoveStatus(removeStatus);
         QVERIFY(saveCacheRecord(*alice));
         QVERIFY(s->root.writeSettings(s->server.settingsIni(settings(enabled, validityDays))));
+        QCOMPARE(s->call("getAccountByUid", "10001").startsWith(passTrue.chopped(1)), removeStatus == 0);
         QTEST(s->login("@alice", "alice-password"), "expected");
         QCOMPARE(s->login("@alice", "x"), passFalse); // "x" is refused before anything
     }

@@ -123,7 +123,7 @@ private Q_SLOTS:
         for (const QByteArray &request :
             { call("queryAccountName", { QStringLiteral("@alice") }), call("queryUid", { QStringLiteral("10001") }),
                 call("authenticatePassword", { QStringLiteral("@alice"), QStringLiteral("x") }),
-                call("modifyUser", { QStringLiteral("not json") }) })
+                call("modifyUser", { QStringLiteral("not json") }), call("listAccounts", {}) })
             QCOMPARE(m_daemon.request(request), passFalse);
         QVERIFY(m_root.writeSettings(settings));
     }

@@ -22,15 +22,8 @@ check() {
 mkdir "$work/src"
 git -C "$top" ls-files -z --cached --others --exclude-standard \
     | tar -C "$top" --null --ignore-failed-read -T - -cf - 2>/dev/null | tar -C "$work/src" -xf -
-packages=(kest-iam libkest-iam1 libkest-iam-dev libnss-kest libpam-kest)
-profiles=()
-if [ ! -e "$top/src/modules" ]; then
-    # Until the module sources land, only the packages that the tree can build.
-    packages=(kest-iam libkest-iam1 libkest-iam-dev)
-    profiles=(-Ppkg.kest-iam.nomodules)
-fi
-(cd "$work/src" && DEB_BUILD_OPTIONS=noautodbgsym dpkg-buildpackage -us -uc -b -J"$(nproc)" "${profiles[@]}") \
-    >"$work/build.log" 2>&1 || { tail -n 40 "$work/build.log"; exit 1; }
+(cd "$work/src" && DEB_BUILD_OPTIONS=noautodbgsym dpkg-buildpackage -us -uc -b -J"$(nproc)") >"$work/build.log" 2>&1 \
+    || { tail -n 40 "$work/build.log"; exit 1; }
 
 version=$(dpkg-parsechangelog -l "$top/debian/changelog" -S Version)
 arch=$(dpkg --print-architecture)
@@ -78,7 +71,7 @@ depends_match() {
     done
 }
 debs=()
-for package in "${packages[@]}"; do
+for package in kest-iam libkest-iam1 libkest-iam-dev libnss-kest libpam-kest; do
     deb="$work/${package}_${version}_$arch.deb"
     debs+=("$deb")
     check "$package holds exactly its files" same_files "$package" "${files[$package]}" "$deb"
@@ -141,21 +134,18 @@ policy_loads() {
 }
 check "dbus-daemon loads the policy file" policy_loads
 
-edit="$top/debian/kest-nsswitch"
-if [[ " ${packages[*]} " == *" libnss-kest "* ]]; then
-    for package in libnss-kest libpam-kest; do
-        dpkg-deb -x "$work/${package}_${version}_$arch.deb" "$work/root"
-        dpkg-deb -e "$work/${package}_${version}_$arch.deb" "$work/$package.control"
-    done
-    edit="$work/root/usr/lib/libnss-kest/kest-nsswitch"
-    hooks() { # hooks PACKAGE POSTINST-TEXT PRERM-TEXT
-        grep -qF -- "$2" "$work/$1.control/postinst" && grep -qF -- "$3" "$work/$1.control/prerm"
-    }
-    check "libnss-kest edits nsswitch.conf on configure and removal" hooks libnss-kest "kest-nsswitch add" \
-        "kest-nsswitch remove"
-    check "libpam-kest runs pam-auth-update on configure and removal" hooks libpam-kest \
-        "pam-auth-update --package" "pam-auth-update --package --remove kest"
-fi
+for package in libnss-kest libpam-kest; do
+    dpkg-deb -x "$work/${package}_${version}_$arch.deb" "$work/root"
+    dpkg-deb -e "$work/${package}_${version}_$arch.deb" "$work/$package.control"
+done
+hooks() { # hooks PACKAGE POSTINST-TEXT PRERM-TEXT
+    grep -qF -- "$2" "$work/$1.control/postinst" && grep -qF -- "$3" "$work/$1.control/prerm"
+}
+check "libnss-kest edits nsswitch.conf on configure and removal" hooks libnss-kest "kest-nsswitch add" \
+    "kest-nsswitch remove"
+check "libpam-kest runs pam-auth-update on configure and removal" hooks libpam-kest "pam-auth-update --package" \
+    "pam-auth-update --package --remove kest"
+edit="$work/root/usr/lib/libnss-kest/kest-nsswitch"
 # nss_edits NAME: installs (twice: a reinstall) and removes with the shipped script on a copy of
 # sample NAME; after each step the copy must equal $NAME.added, then $NAME.removed.
 nss_edits() {

@@ -1,0 +1,110 @@
+/* daemon-client.c - the modules' function calls to cache-kest */
+#define _GNU_SOURCE
+#include "daemon-client.h"
+
+#include "common.h"
+#include "json-reader.h"
+
+#include <arpa/inet.h>
+#include <stdint.h>
+#include <stdlib.h>
+#include <string.h>
+
+#define SOURCE_PATH "src/modules/daemon-client"
+#define PROCESS_NAME_SIZE 64
+#define REQUEST_SIZE 16384
+/* A listing of every cached account is the longest reply; far below this even for many thousands. */
+#define REPLY_LIMIT (64 * 1024 * 1024)
+
+int kest_daemon_reachable(void)
+{
+    char process[PROCESS_NAME_SIZE];
+    memset(process, 0, sizeof(process));
+    if (get_process_name(process) && strcmp(process, "cache-kest") == 0)
+        return 0;
+    return is_cache_daemon_running();
+}
+
+static int append_raw(char *out, size_t size, size_t *length, const char *text)
+{
+    size_t extra = strlen(text);
+    if (*length + extra >= size)
+        return 0;
+    memcpy(out + *length, text, extra);
+    *length += extra;
+    return 1;
+}
+
+/* Written straight into out: no other copy of a password is left on the stack. */
+static int append_json_string(char *out, size_t size, size_t *length, const char *text)
+{
+    static const char hex[] = "0123456789abcdef";
+    if (!append_raw(out, size, length, "\""))
+        return 0;
+    for (const unsigned char *c = (const unsigned char *)text; *c != '\0'; ++c) {
+        /* Room for the longest form, \u00XX, then the closing quote and a NUL. */
+        if (*length + 8 > size)
+            return 0;
+        if (*c == '"' || *c == '\\') {
+            out[(*length)++] = '\\';
+            out[(*length)++] = (char)*c;
+        } else if (*c < 0x20) {
+            memcpy(out + *length, "\\u00", 4);
+            out[*length + 4] = hex[*c >> 4];
+            out[*length + 5] = hex[*c & 15];
+            *length += 6;
+        } else {
+            out[(*length)++] = (char)*c;
+        }
+    }
+    return append_raw(out, size, length, "\"");
+}
+
+int kest_json_object(char *out, size_t size, const char *const *pairs, size_t count)
+{
+    size_t length = 0;
+    int fits = append_raw(out, size, &length, "{");
+    for (size_t i = 0; fits && i < count; ++i)
+        fits = (i == 0 || append_raw(out, size, &length, ",")) && append_json_string(out, size, &length, pairs[2 * i])
+            && append_raw(out, size, &length, ":") && append_json_string(out, size, &length, pairs[2 * i + 1]);
+    if (!fits || !append_raw(out, size, &length, "}"))
+        return 0;
+    out[length] = '\0';
+    return 1;
+}
+
+/* The whole frame: length prefix and {"version","functionName","argv"}; 0 when it does not fit. */
+static size_t build_request(char *out, size_t size, const char *function, const char *const *argv, size_t argc)
+{
+    size_t length = 4;
+    int fits = append_raw(out, size, &length, "{\"version\":16777216,\"functionName\":")
+        && append_json_string(out, size, &length, function) && append_raw(out, size, &length, ",\"argv\":[");
+    for (size_t i = 0; fits && i < argc; ++i)
+        fits = (i == 0 || append_raw(out, size, &length, ","))
+            && append_json_string(out, size, &length, argv[i] ? argv[i] : "");
+    if (!fits || !append_raw(out, size, &length, "]}"))
+        return 0;
+    uint32_t payload = htonl((uint32_t)(length - 4));
+    memcpy(out, &payload, sizeof(payload));
+    return length;
+}
+
+int kest_call(const char *function, const char *const *argv, size_t argc, char **reply)
+{
+    *reply = NULL;
+    if (!kest_daemon_reachable())
+        return 0;
+    char request[REQUEST_SIZE];
+    size_t length = build_request(request, sizeof(request), function, argv, argc);
+    int answered = length > 0 && socket_query_frame(request, length, reply, NULL, REPLY_LIMIT);
+    explicit_bzero(request, sizeof(request));
+    if (length == 0)
+        log_message(3, SOURCE_PATH, __LINE__, __func__, "request %s too long for cache-kest", function);
+    return answered;
+}
+
+int kest_reply_passed(const char *reply)
+{
+    int passed = 0;
+    return json_bool(json_member(reply, "pass"), &passed) && passed;
+}
