@@ -1,9 +1,9 @@
 #!/usr/bin/env bash
-# check-package.sh BUILD_DIR - builds the Debian package from BUILD_DIR and checks what it holds:
-# the expected files and nothing outside them, the runtime dependencies, units that systemd
-# accepts (where systemd-analyze is present) and a bus policy that dbus-daemon loads.
+# check-package.sh - builds the Debian packages from a copy of the source tree and checks them: each
+# package's files and dependencies, lintian, units that systemd accepts, a bus policy that dbus-daemon
+# loads, and libnss-kest's nsswitch.conf edits on sample copies.
 set -euo pipefail
-build=$1
+top=$(cd "$(dirname "$0")/../.." && pwd)
 work=$(mktemp -d)
 daemon_pid=
 cleanup() {
@@ -18,49 +18,91 @@ check() {
     if "${@:2}"; then passed=$((passed + 1)) && echo "PASS: $1"; else failed=$((failed + 1)) && echo "FAIL: $1"; fi
 }
 
-cpack --config "$build/CPackConfig.cmake" -B "$work/out" >"$work/cpack.log" 2>&1 || { cat "$work/cpack.log"; exit 1; }
-deb=$(ls "$work"/out/*.deb)
+# dpkg-buildpackage writes into the tree and its parent: build from a copy.
+mkdir "$work/src"
+git -C "$top" ls-files -z --cached --others --exclude-standard \
+    | tar -C "$top" --null --ignore-failed-read -T - -cf - 2>/dev/null | tar -C "$work/src" -xf -
+(cd "$work/src" && DEB_BUILD_OPTIONS=noautodbgsym dpkg-buildpackage -us -uc -b -J"$(nproc)") >"$work/build.log" 2>&1 \
+    || { tail -n 40 "$work/build.log"; exit 1; }
+
+version=$(dpkg-parsechangelog -l "$top/debian/changelog" -S Version)
 arch=$(dpkg --print-architecture)
-multiarch=$(gcc -print-multiarch)
-check "package file name" test "$(basename "$deb")" = "kest-iam_1.0.0_${arch}.deb"
-
-dpkg-deb -c "$deb" | awk '{print $6}' | sed -e 's|^\./|/|' -e 's|/$||' | grep -v '^$' >"$work/files"
-expected=(/etc/kest-iam.conf /usr/bin/cache-kest /usr/sbin/dbus-kest /usr/share/kest
-    /usr/include/kest-iam/{common,cache-common,paths}.h "/usr/lib/$multiarch/libkest-iam.so"
-    "/usr/lib/$multiarch/libkest-iam.so.1" "/usr/lib/$multiarch/pkgconfig/kest-iam.pc"
-    /usr/lib/systemd/system/{cache-kest,dbus-kest}.service
-    /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf
-    "/usr/lib/$multiarch/libnss_kest.so.2" "/usr/lib/$multiarch/security/pam_kest.so" /usr/share/pam-configs/kest
+ma=$(dpkg-architecture -q DEB_HOST_MULTIARCH)
+declare -A files=(
+    [kest-iam]="/etc/kest-iam.conf /lib/systemd/system/cache-kest.service /lib/systemd/system/dbus-kest.service
+        /usr/bin/cache-kest /usr/sbin/dbus-kest /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service
+        /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf /usr/share/kest /usr/share/man/man5/kest-iam.conf.5.gz
+        /usr/share/man/man8/cache-kest.8.gz /usr/share/man/man8/dbus-kest.8.gz /var/lib/libkest-iam"
+    [libkest-iam1]="/usr/lib/$ma/libkest-iam.so.1 /usr/lib/$ma/libkest-iam.so.1.0.0"
+    [libkest-iam-dev]="/usr/include/kest-iam/cache-common.h /usr/include/kest-iam/common.h
+        /usr/include/kest-iam/paths.h /usr/lib/$ma/libkest-iam.so /usr/lib/$ma/pkgconfig/kest-iam.pc"
+    [libnss-kest]="/usr/lib/$ma/libnss_kest.so.2 /usr/lib/libnss-kest/kest-nsswitch
+        /usr/share/man/man8/libnss_kest.8.gz"
+    [libpam-kest]="/usr/lib/$ma/security/pam_kest.so /usr/share/pam-configs/kest /usr/share/man/man8/pam_kest.8.gz"
 )
-for file in "${expected[@]}"; do
-    check "package holds $file" grep -qx -- "$file" "$work/files"
-done
+# Patterns, separated by ";", that must (or, after "!", must not) match a package's Depends.
+declare -A depends=(
+    [kest-iam]="libqt5core5a;libqt5network5;libqt5dbus5;dbus-system-bus"
+    [libkest-iam1]="libc6;!libqt5"
+    [libkest-iam-dev]="^libkest-iam1 (= $version)"
+    [libnss-kest]="kest-iam (= $version);!libqt5"
+    [libpam-kest]="kest-iam (= $version);libpam0g;libpam-runtime;!libqt5"
+)
 
-# Every entry is one of the files above, a directory on the way to one, or the library's real file.
-outside() {
-    local entry file
-    while read -r entry; do
-        [[ $entry == "/usr/lib/$multiarch/libkest-iam.so.1."* ]] && continue
-        for file in "${expected[@]}"; do
-            [[ $file == "$entry" || $file == "$entry"/* ]] && continue 2
-        done
-        echo "unexpected: $entry"
-        return 1
-    done <"$work/files"
+# Files, links and empty directories: every entry that is not the directory of another one.
+leaves() {
+    dpkg-deb -c "$1" | awk '{print $6}' | sed -e 's|^\./|/|' -e 's|/$||' | grep -v '^$' | sort \
+        | awk '{ entry[NR] = $0 } END { for (i = 1; i <= NR; i++) { leaf = 1
+              for (j = 1; j <= NR; j++) if (index(entry[j], entry[i] "/") == 1) leaf = 0
+              if (leaf) print entry[i] } }'
 }
-check "nothing outside the listed paths" outside
-
-depends=$(dpkg-deb -f "$deb" Depends)
-for package in libqt5core5a libqt5network5 libqt5dbus5 dbus; do
-    check "depends on $package" grep -q "$package" <<<"$depends"
+same_files() {
+    diff <(printf '%s\n' $2 "/usr/share/doc/$1/changelog.gz" "/usr/share/doc/$1/copyright" | sort) <(leaves "$3")
+}
+depends_match() {
+    local field pattern
+    field=$(dpkg-deb -f "$1" Depends)
+    for pattern in "${@:2}"; do
+        if [[ $pattern == !* ]]; then
+            ! grep -q -- "${pattern#!}" <<<"$field" || { echo "Depends: $field"; return 1; }
+        else
+            grep -q -- "$pattern" <<<"$field" || { echo "Depends: $field"; return 1; }
+        fi
+    done
+}
+debs=()
+for package in kest-iam libkest-iam1 libkest-iam-dev libnss-kest libpam-kest; do
+    deb="$work/${package}_${version}_$arch.deb"
+    debs+=("$deb")
+    check "$package holds exactly its files" same_files "$package" "${files[$package]}" "$deb"
+    IFS=';' read -ra patterns <<<"${depends[$package]}"
+    check "$package dependencies" depends_match "$deb" "${patterns[@]}"
 done
-check "settings file is a conffile" sh -c "dpkg-deb -I '$deb' conffiles | grep -qx /etc/kest-iam.conf"
 
-dpkg-deb -x "$deb" "$work/root"
-for key in enable ip port network-timeout domain entryption home protocol user auth group reset_password \
-    server-cert public-key private-key length-limit buffer-limit member-count-limit cache_validity; do
-    check "sample settings list $key" grep -q "^;$key=" "$work/root/etc/kest-iam.conf"
-done
+lintian_clean() {
+    lintian --fail-on error,warning "${debs[@]}" >"$work/lintian.log" 2>&1 || { cat "$work/lintian.log"; return 1; }
+}
+check "lintian: no error, no warning" lintian_clean
+
+dpkg-deb -x "$work/kest-iam_${version}_$arch.deb" "$work/root"
+dpkg-deb -e "$work/kest-iam_${version}_$arch.deb" "$work/control"
+check "settings file is the only conffile" test "$(cat "$work/control/conffiles")" = /etc/kest-iam.conf
+# Enabled for the next boot; started only by the administrator.
+units_enabled_not_started() {
+    grep -q "deb-systemd-helper enable 'cache-kest.service'" "$work/control/postinst" \
+        && grep -q "deb-systemd-helper enable 'dbus-kest.service'" "$work/control/postinst" \
+        && ! grep -q "deb-systemd-invoke start" "$work/control/postinst"
+}
+check "units enabled on installation, not started" units_enabled_not_started
+settings_list_keys() {
+    local key missing=()
+    for key in enable ip port network-timeout domain entryption home protocol user auth group reset_password \
+        server-cert public-key private-key length-limit buffer-limit member-count-limit cache_validity; do
+        grep -q "^;$key=" "$work/root/etc/kest-iam.conf" || missing+=("$key")
+    done
+    [ ${#missing[@]} -eq 0 ] || { echo "missing: ${missing[*]}"; return 1; }
+}
+check "sample settings list every key" settings_list_keys
 check "activation file names the unit" grep -qx "SystemdService=dbus-kest.service" \
     "$work/root/usr/share/dbus-1/system-services/com.nimbal.kest.iam.service"
 
@@ -68,11 +110,13 @@ if command -v systemd-analyze >/dev/null; then
     # Point the units at the unpacked programs so that systemd can check them here.
     mkdir -p "$work/units"
     for unit in cache-kest dbus-kest; do
-        sed "s|^ExecStart=|ExecStart=$work/root|" "$work/root/usr/lib/systemd/system/$unit.service" >"$work/units/$unit.service"
+        sed "s|^ExecStart=|ExecStart=$work/root|" "$work/root/lib/systemd/system/$unit.service" \
+            >"$work/units/$unit.service"
     done
+    # The manual pages named by Documentation= are looked up among the unpacked ones.
     verify_units() {
-        systemd-analyze verify "$work"/units/*.service >"$work/verify.log" 2>&1 && ! grep -q . "$work/verify.log" \
-            || { cat "$work/verify.log"; return 1; }
+        MANPATH="$work/root/usr/share/man" systemd-analyze verify "$work"/units/*.service >"$work/verify.log" 2>&1 \
+            && ! grep -q . "$work/verify.log" || { cat "$work/verify.log"; return 1; }
     }
     check "systemd accepts the units" verify_units
 else
@@ -89,6 +133,47 @@ policy_loads() {
     grep -q '^unix:' <<<"$out"
 }
 check "dbus-daemon loads the policy file" policy_loads
+
+for package in libnss-kest libpam-kest; do
+    dpkg-deb -x "$work/${package}_${version}_$arch.deb" "$work/root"
+    dpkg-deb -e "$work/${package}_${version}_$arch.deb" "$work/$package.control"
+done
+hooks() { # hooks PACKAGE POSTINST-TEXT PRERM-TEXT
+    grep -qF -- "$2" "$work/$1.control/postinst" && grep -qF -- "$3" "$work/$1.control/prerm"
+}
+check "libnss-kest edits nsswitch.conf on configure and removal" hooks libnss-kest "kest-nsswitch add" \
+    "kest-nsswitch remove"
+check "libpam-kest runs pam-auth-update on configure and removal" hooks libpam-kest "pam-auth-update --package" \
+    "pam-auth-update --package --remove kest"
+edit="$work/root/usr/lib/libnss-kest/kest-nsswitch"
+# nss_edits NAME: installs (twice: a reinstall) and removes with the shipped script on a copy of
+# sample NAME; after each step the copy must equal $NAME.added, then $NAME.removed.
+nss_edits() {
+    local sample="$work/nsswitch/$1"
+    cp "$sample" "$sample.copy"
+    "$edit" add "$sample.copy" && cmp "$sample.added" "$sample.copy" \
+        && "$edit" add "$sample.copy" && cmp "$sample.added" "$sample.copy" \
+        && "$edit" remove "$sample.copy" && cmp "$sample.removed" "$sample.copy" \
+        || { diff "$sample" "$sample.copy"; return 1; }
+}
+mkdir "$work/nsswitch"
+cd "$work/nsswitch"
+printf '%s\n' '# /etc/nsswitch.conf' '#' '# Example configuration of GNU Name Service Switch functionality.' '' \
+    'passwd:         files systemd' 'group:          files systemd' 'shadow:         files systemd' '' \
+    'hosts:          files dns' >default
+sed -e 's/^\(passwd\|group\)\(.*\)$/\1\2 kest/' default >default.added
+cp default default.removed
+printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap\t# directory after the local files' \
+    'group:  files [NOTFOUND=continue] sss kestrel' 'shadow: files ldap' 'initgroups: files' >others
+printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap kest\t# directory after the local files' \
+    'group:  files [NOTFOUND=continue] sss kestrel kest' 'shadow: files ldap' 'initgroups: files' >others.added
+cp others others.removed
+printf '%s\n' 'passwd: files kest systemd # listed by hand' 'group:kest files' 'shadow: files kest' >listed
+cp listed listed.added
+printf '%s\n' 'passwd: files systemd # listed by hand' 'group: files' 'shadow: files kest' >listed.removed
+for sample in default others listed; do
+    check "nsswitch.conf sample $sample: install, reinstall and remove" nss_edits "$sample"
+done
 
 echo "$passed passed, $failed failed"
 [ "$failed" -eq 0 ]
