@@ -31,12 +31,12 @@ QFileInfoList regularFiles()
     return QDir(workDir()).entryInfoList(QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot, QDir::Unsorted);
 }
 
-bool holdsAccount(quint32 uid, const QString &account)
+CacheControlPtr recordHolding(quint32 uid, const QString &account)
 {
     CacheControlPtr record = createCacheControl();
     record->setUid(uid);
     loadCacheRecord(record);
-    return record && record->account() == account;
+    return record && record->account() == account ? record : CacheControlPtr();
 }
 
 // Under the rules of the listing, so that a known uid finds nothing the listing would skip.
@@ -155,22 +155,23 @@ QList<quint32> listCacheUids()
     return uids;
 }
 
-bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid)
+bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid, CacheControlPtr *found)
 {
     uid = 0;
-    if (knownUid != 0 && isRecordFile(knownUid) && holdsAccount(knownUid, account)) {
+    CacheControlPtr record = knownUid != 0 && isRecordFile(knownUid) ? recordHolding(knownUid, account) : nullptr;
+    if (record)
         uid = knownUid;
-        return true;
-    }
-    const QStringList paths = listCacheFiles();
+    const QStringList paths = record ? QStringList() : listCacheFiles();
     for (const QString &path : paths) {
         const quint32 candidate = uidOfCacheFilePath(path);
-        if (!path.endsWith(QString::number(candidate)) || !holdsAccount(candidate, account))
+        if (!path.endsWith(QString::number(candidate)) || !(record = recordHolding(candidate, account)))
             continue;
         uid = candidate;
-        return true;
+        break;
     }
-    return false;
+    if (found)
+        *found = record;
+    return record != nullptr;
 }
 
 void removeCacheFile(quint32 uid)

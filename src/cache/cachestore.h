@@ -25,7 +25,9 @@ quint32 uidOfCacheFilePath(const QString &path);
 QStringList listCacheFiles();
 QList<quint32> listCacheUids();
 // The file of knownUid, where the caller's user list has the account, is looked at before the whole store.
-bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid = 0);
+// found, when given, receives the record that was read to find the account.
+bool findCacheUidByAccount(
+    const QString &account, quint32 &uid, quint32 knownUid = 0, CacheControlPtr *found = nullptr);
 void removeCacheFile(quint32 uid);
 void removeAllCacheFiles();
 // Hands every domain user's record file to root, then deletes it.

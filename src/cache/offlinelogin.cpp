@@ -12,25 +12,17 @@ bool offlineLoginEnabled()
     return SettingsFile::value(QStringLiteral("offline_login"), QStringLiteral("enable"), false).toBool();
 }
 
-// A record that cannot be read counts as an empty one: never marked, never effective.
-CacheControlPtr loadedRecord(quint32 uid)
-{
-    CacheControlPtr record = createCacheControl();
-    record->setUid(uid);
-    loadCacheRecord(record);
-    return record ? record : createCacheControl();
-}
 } // namespace
 
 // The order of the tests decides which single warning a refusal leaves.
 bool checkOfflineLogin(const QString &account, quint32 knownUid)
 {
     quint32 uid = 0;
-    if (!findCacheUidByAccount(account, uid, knownUid)) {
+    CacheControlPtr record;
+    if (!findCacheUidByAccount(account, uid, knownUid, &record)) {
         qWarning().noquote() << QStringLiteral("[checkOfflineLogin]: Cache file not found");
         return false;
     }
-    const CacheControlPtr record = loadedRecord(uid);
     const bool enabled = offlineLoginEnabled();
     if (record->removeStatus() != 0) {
         qWarning().noquote() << QStringLiteral("[removeStatus]: The cache file is marked for deletion: ")

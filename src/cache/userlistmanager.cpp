@@ -234,8 +234,11 @@ void UserListManager::rebuildUsers(HttpHelper *helper)
         if (!isValidDomainAccountName(entry->name))
             continue;
         const QString reply = helper->queryUserByName(entry->name);
-        if (reply == HttpHelper::unreachableReply()) {
-            // Lost the server half-way: keep what is known rather than dropping the account.
+        const bool lost = reply == HttpHelper::unreachableReply()
+            || (reply == HttpHelper::refusedReply() && !helper->lastRequestAnswered());
+        if (lost) {
+            // Lost the server half-way (no connection, or no answer on it): keep what is known rather than
+            // dropping the account.
             appendUser(entry);
             continue;
         }

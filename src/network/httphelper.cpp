@@ -189,8 +189,9 @@ bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configurat
         m_tlsConfiguration.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
         // Exactly the configured authorities: the system's store would let any public CA vouch for an impostor.
         const QList<QSslCertificate> authorities = certificatesIn(caPath);
-        m_tlsUsable = !authorities.isEmpty() || !literalAddress;
-        if (!authorities.isEmpty())
+        m_tlsOwnAuthorities = !authorities.isEmpty();
+        m_tlsUsable = m_tlsOwnAuthorities || !literalAddress;
+        if (m_tlsOwnAuthorities)
             m_tlsConfiguration.setCaCertificates(authorities);
         const QList<QSslCertificate> chain = certificatesIn(chainPath);
         if (chain.isEmpty())
@@ -203,7 +204,7 @@ bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configurat
         else
             m_tlsConfiguration.setPrivateKey(QSslKey(&keyFile, QSsl::Rsa, QSsl::Pem, QSsl::PrivateKey));
     }
-    if (m_tlsConfiguration.caCertificates().isEmpty() || !m_tlsUsable)
+    if (!m_tlsOwnAuthorities)
         warn(QStringLiteral("cannot set server key."));
     configuration = m_tlsConfiguration;
     return m_tlsUsable;
@@ -283,6 +284,7 @@ bool HttpHelper::exchange(
     PathSetting path, const QByteArray &method, const BodyBuilder &body, QJsonObject &object, QString &failure)
 {
     failure = unreachableReply();
+    m_lastAnswered = false;
     if (!QFile::exists(KestPaths::settingsFile())) {
         warn(QStringLiteral("configuration file is broken."));
         return false;
@@ -295,6 +297,7 @@ bool HttpHelper::exchange(
     const GlobalSetting *settings = GlobalSetting::instance();
     const QString url = settings->protocol() + target.hostPort + (settings->*path)();
     const DomainExchange reply = sendRequest(url, method, body());
+    m_lastAnswered = reply.status != 0;
     if (!reply.connected) {
         m_reachability->markUnreachable(target.hostPort, reply.connectError);
         return false;

@@ -48,6 +48,9 @@ public:
     int parseReply(const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonDocument &document);
     bool checkReplyData(const QString &url, const QByteArray &method, const DomainExchange &reply, QJsonObject &object);
     QString readMachineId();
+    // Whether the server answered the last request at all (an HTTP status came back), so that a caller can
+    // tell a refusal from a connection lost half-way.
+    bool lastRequestAnswered() const { return m_lastAnswered; }
 
     QString queryUserByName(const QString &name);
     QString queryUserByUid(uint uid);
@@ -80,5 +83,7 @@ private:
     QString m_tlsKey;
     QSslConfiguration m_tlsConfiguration;
     bool m_tlsUsable = false;
+    bool m_tlsOwnAuthorities = false;
+    bool m_lastAnswered = false;
     QDeadlineTimer m_callDeadline { QDeadlineTimer::Forever };
 };

@@ -163,6 +163,12 @@ private Q_SLOTS:
         server.stop();
         users.rebuildUsers(&http);
         QCOMPARE(users.users().size(), 1);
+        // A connection that ends without an answer is a lost server too, not a refusal.
+        QVERIFY(server.start(server.port())
+            && server.setMisbehaviour(QStringLiteral("/v3/account/"), QStringLiteral("close")));
+        HttpHelper fresh;
+        users.rebuildUsers(&fresh);
+        QVERIFY(users.hasUserName(QStringLiteral("@alice")) && record(10001));
     }
 };
 
