@@ -9,6 +9,7 @@
 #include "echoserver.h"
 #include "logindstandin.h"
 #include "privatebus.h"
+#include "rawconnection.h"
 #include "testroot.h"
 #include "userlistmanager.h"
 
@@ -28,17 +29,12 @@
 #include <QTest>
 #include <QTextStream>
 #include <QThread>
-#include <QtEndian>
 
 #include <algorithm>
 #include <functional>
 
-#include <arpa/inet.h>
 #include <dlfcn.h>
-#include <netinet/in.h>
 #include <pwd.h>
-#include <sys/socket.h>
-#include <sys/time.h>
 #include <unistd.h>
 
 namespace
@@ -57,34 +53,13 @@ double percentile(QList<double> samples, double fraction)
     return samples.at(qMin(samples.size() - 1, int(fraction * samples.size())));
 }
 
-// What the modules' client does for one call: connect, send one frame, read the reply, close.
 bool roundTrip(quint16 port, const QByteArray &frame, QByteArray *reply = nullptr)
 {
-    const int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address {};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(port);
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    const timeval timeout { 10, 0 };
-    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof(timeout));
-    bool ok = connect(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) == 0
-        && send(fd, frame.constData(), size_t(frame.size()), 0) == frame.size();
     char buffer[65536];
-    ssize_t have = 0;
-    while (ok) {
-        const ssize_t got = recv(fd, buffer + have, sizeof(buffer) - size_t(have), 0);
-        if (got <= 0) {
-            ok = false;
-            break;
-        }
-        have += got;
-        if (have >= 4 && have >= 4 + ssize_t(qFromBigEndian<quint32>(buffer)))
-            break;
-    }
-    close(fd);
-    if (ok && reply)
-        *reply = QByteArray(buffer + 4, int(have - 4));
-    return ok;
+    const int length = RawConnection::exchange(port, frame, buffer, sizeof(buffer));
+    if (length >= 4 && reply)
+        *reply = QByteArray(buffer + 4, length - 4);
+    return length >= 4;
 }
 
 QList<double> measure(int count, const std::function<void()> &action)

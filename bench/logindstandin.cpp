@@ -4,7 +4,6 @@
 #include <QDBusMessage>
 #include <QDBusVariant>
 #include <QDBusVirtualObject>
-#include <QSemaphore>
 
 namespace
 {
@@ -24,8 +23,6 @@ public:
         return true;
     }
 };
-
-QSemaphore ready;
 } // namespace
 
 LogindStandIn::~LogindStandIn()
@@ -38,7 +35,7 @@ bool LogindStandIn::begin(const QString &address)
 {
     m_address = address;
     start();
-    ready.acquire();
+    m_ready.acquire();
     return m_owned;
 }
 
@@ -50,7 +47,7 @@ void LogindStandIn::run()
     Sessions sessions;
     m_owned = bus.registerService(service)
         && bus.registerVirtualObject(QStringLiteral("/org/freedesktop/login1"), &sessions, QDBusConnection::SubPath);
-    ready.release();
+    m_ready.release();
     exec();
     bus.unregisterObject(QStringLiteral("/org/freedesktop/login1"));
     QDBusConnection::disconnectFromBus(name);

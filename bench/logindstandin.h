@@ -1,5 +1,6 @@
 #pragma once
 
+#include <QSemaphore>
 #include <QString>
 #include <QThread>
 
@@ -18,4 +19,5 @@ protected:
 private:
     bool m_owned = false;
     QString m_address;
+    QSemaphore m_ready;
 };

@@ -10,7 +10,6 @@
 #include <QFile>
 #include <QJsonArray>
 #include <QJsonDocument>
-#include <QPointer>
 #include <QSettings>
 #include <QTcpSocket>
 #include <QTimer>
@@ -77,45 +76,17 @@ void KestCacheLocalServer::onAcceptError(QAbstractSocket::SocketError error)
 
 void KestCacheLocalServer::onDisconnected()
 {
-    auto *socket = qobject_cast<QTcpSocket *>(sender());
-    if (!socket)
-        return;
-    if (m_busy)
-        m_closed.append(socket);
-    else
+    if (auto *socket = qobject_cast<QTcpSocket *>(sender()))
         socket->deleteLater();
 }
 
+// The domain client blocks without running an event loop, so no other request is taken up and no
+// socket is deleted while one is answered: requests are served one at a time, in the order read.
 void KestCacheLocalServer::onReadyRead()
 {
     auto *socket = qobject_cast<QTcpSocket *>(sender());
     if (!socket)
         return;
-    if (m_busy) {
-        if (!m_waiting.contains(socket))
-            m_waiting.append(socket);
-        return;
-    }
-    readRequest(socket);
-    takeWaitingRequests();
-}
-
-void KestCacheLocalServer::takeWaitingRequests()
-{
-    while (!m_waiting.isEmpty()) {
-        const QPointer<QTcpSocket> socket = m_waiting.takeFirst();
-        if (socket)
-            readRequest(socket);
-    }
-    for (const QPointer<QTcpSocket> &socket : qAsConst(m_closed)) {
-        if (socket)
-            socket->deleteLater();
-    }
-    m_closed.clear();
-}
-
-void KestCacheLocalServer::readRequest(QTcpSocket *socket)
-{
     // Strictly more than the length prefix: an empty frame waits for further bytes.
     if (socket->bytesAvailable() <= 4) {
         watchPartialFrame(socket);
@@ -134,9 +105,7 @@ void KestCacheLocalServer::readRequest(QTcpSocket *socket)
     }
     socket->read(4);
     const QByteArray payload = socket->read(length);
-    m_busy = true;
     handleRequest(socket, payload);
-    m_busy = false;
     watchPartialFrame(socket);
 }
 

@@ -1,8 +1,6 @@
 #pragma once
 
 #include <QJsonObject>
-#include <QList>
-#include <QPointer>
 #include <QTcpServer>
 
 #include <memory>
@@ -32,8 +30,6 @@ private Q_SLOTS:
     void onDisconnected();
 
 private:
-    void readRequest(QTcpSocket *socket);
-    void takeWaitingRequests();
     void handleRequest(QTcpSocket *socket, const QByteArray &payload);
     bool writeReply(QTcpSocket *socket, const QByteArray &framed);
     void watchPartialFrame(QTcpSocket *socket);
@@ -51,9 +47,4 @@ private:
     QString modifyUserPassword(QTcpSocket *socket, const QJsonValue &data);
 
     std::unique_ptr<KestCacheService> m_service;
-    // One request at a time: while one is answered, other sockets wait here in the order they became
-    // readable, and sockets whose peers left are deleted only afterwards.
-    bool m_busy = false;
-    QList<QPointer<QTcpSocket>> m_waiting;
-    QList<QPointer<QTcpSocket>> m_closed;
 };

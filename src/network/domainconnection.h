@@ -54,8 +54,6 @@ public:
 
     // Used for new connections to this endpoint; a different endpoint drops the kept connection.
     void setEndpoint(const DomainEndpoint &endpoint, const QSslConfiguration &configuration);
-    const DomainEndpoint &endpoint() const { return m_endpoint; }
-    bool hasEndpoint() const { return m_hasEndpoint; }
     bool isAlive() const;
 
     DomainExchange exchange(const QByteArray &request, QDeadlineTimer connectDeadline, QDeadlineTimer deadline);

@@ -9,11 +9,7 @@
 #include <QTest>
 #include <QtEndian>
 
-#include <arpa/inet.h>
 #include <grp.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/time.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -24,25 +20,9 @@ void replyAsUser(uint uid, quint16 port, const QByteArray &frame, int out)
 {
     if (setgroups(0, nullptr) != 0 || setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0)
         _exit(2);
-    const int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address {};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(port);
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    const timeval timeout { 20, 0 };
-    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof(timeout));
-    if (connect(fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) != 0
-        || send(fd, frame.constData(), size_t(frame.size()), 0) != frame.size())
-        _exit(3);
-    char buffer[4096];
-    ssize_t received;
-    while ((received = recv(fd, buffer, sizeof(buffer), 0)) > 0) {
-        if (write(out, buffer, size_t(received)) != received)
-            _exit(4);
-        if (received < ssize_t(sizeof(buffer)))
-            break;
-    }
-    _exit(0);
+    char reply[65536];
+    const int length = RawConnection::exchange(port, frame, reply, sizeof(reply));
+    _exit(length > 0 && write(out, reply, size_t(length)) == length ? 0 : 3);
 }
 } // namespace
 

@@ -18,6 +18,10 @@ public:
     bool closedWithin(int timeoutMs) { return !isConnected() || m_socket.waitForDisconnected(timeoutMs); }
     void abort() { m_socket.abort(); }
 
+    // What the modules' client does, in system calls only (safe in a forked child): connect, send one
+    // frame, read one whole reply frame, close. The reply frame's length, or -1.
+    static int exchange(quint16 port, const QByteArray &frame, char *reply, int capacity);
+
 private:
     QTcpSocket m_socket;
     QByteArray m_buffer;
