@@ -277,18 +277,6 @@ private Q_SLOTS:
         QCOMPARE(userProperty(10002, "Uid").isValid(), method != QLatin1String("RemoveAllCacheFiles"));
     }
 
-    void userIdList()
-    {
-        for (const uint uid : { 10030u, 65534u, 10200u, 99999u })
-            QVERIFY(writeRecord(uid, QStringLiteral("@user") + QString::number(uid)));
-        QVERIFY(m_root.writeFile(QStringLiteral("/var/lib/libkest-iam/10001.bak"), "not a record"));
-        const QList<quint32> listing = listCacheUids();
-        QCOMPARE(listing.size(), 6);
-        QCOMPARE(qdbus_cast<QList<uint>>(call(QStringLiteral("GetUserIdList"))), listing);
-        QVERIFY(m_root.writeSettings(kOff));
-        QCOMPARE(qdbus_cast<QList<uint>>(call(QStringLiteral("GetUserIdList"))), QList<uint>());
-    }
-
     // The service object in this process, so that its messages can be read back.
     void messages_data()
     {
