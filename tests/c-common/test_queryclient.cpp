@@ -1,54 +1,9 @@
 #include "common.h"
+#include "loopbackpeer.h"
 #include "syslogcapture.h"
 #include "testroot.h"
 
 #include <QTest>
-
-#include <arpa/inet.h>
-#include <thread>
-#include <unistd.h>
-#include <utility>
-
-namespace
-{
-// A listening socket on 127.0.0.1; serve() answers one connection from a thread and keeps its request.
-struct Peer {
-    Peer()
-    {
-        sockaddr_in address {};
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        socklen_t length = sizeof(address);
-        bind(fd, reinterpret_cast<sockaddr *>(&address), length);
-        listen(fd, 1);
-        getsockname(fd, reinterpret_cast<sockaddr *>(&address), &length);
-        port = ntohs(address.sin_port);
-    }
-    ~Peer() { stop(); }
-    // Nobody listens on the port any more; the answering thread has ended.
-    void stop()
-    {
-        shutdown(fd, SHUT_RDWR);
-        if (thread.joinable())
-            thread.join();
-        close(std::exchange(fd, -1));
-    }
-    void serve(const QByteArray &answer)
-    {
-        thread = std::thread([this, answer]() {
-            const int connection = accept(fd, nullptr, nullptr);
-            char buffer[256];
-            received = QByteArray(buffer, int(qMax<ssize_t>(recv(connection, buffer, sizeof(buffer), 0), 0)));
-            send(connection, answer.constData(), size_t(answer.size()), MSG_NOSIGNAL);
-            close(connection);
-        });
-    }
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    quint16 port = 0;
-    QByteArray received;
-    std::thread thread;
-};
-} // namespace
 
 class QueryClientTest : public QObject
 {
@@ -100,10 +55,11 @@ private Q_SLOTS:
         QFETCH(QByteArray, answer);
         QFETCH(QByteArray, result);
         TestRoot root;
-        Peer peer;
-        answer.isNull() ? peer.stop() : peer.serve(answer);
+        LoopbackPeer peer(answer.isNull() ? QList<QByteArray>() : QList<QByteArray> { answer });
+        if (answer.isNull())
+            peer.finish();
         if (pidFile)
-            QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"), "1\n" + QByteArray::number(peer.port)));
+            QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"), "1\n" + QByteArray::number(peer.port())));
 
         const QByteArray request("\0\0\0\2{}", 6);
         QByteArray reply(64, 0x7f);
@@ -111,10 +67,10 @@ private Q_SLOTS:
         QCOMPARE(socket_query(request.constData(), size_t(request.size()),
                      reinterpret_cast<unsigned char *>(reply.data()), size_t(reply.size())),
             success ? 1 : 0);
-        peer.stop();
+        const QList<QByteArray> received = peer.finish();
         if (success) {
             QCOMPARE(reply, result + QByteArray(reply.size() - result.size(), '\0'));
-            QCOMPARE(peer.received, request);
+            QCOMPARE(received, QList<QByteArray> { request });
             QVERIFY(SyslogCapture::lines().isEmpty());
             return;
         }

@@ -1,6 +1,7 @@
 #include "blackhole.h"
 #include "cachedaemonfixture.h"
 #include "domainserverfixture.h"
+#include "loopbackpeer.h"
 #include "testroot.h"
 
 #include <QJsonDocument>
@@ -8,12 +9,10 @@
 #include <QProcess>
 #include <QTest>
 
-#include <arpa/inet.h>
 #include <dlfcn.h>
 #include <grp.h>
 #include <nss.h>
 #include <pwd.h>
-#include <thread>
 #include <unistd.h>
 
 namespace
@@ -26,48 +25,15 @@ QString modulePath(const char *name)
 const char aliceEntry[]
     = R"({"pass":true,"user":{"gecos":"Alice","gid":10000,"home":"/home/alice","name":"@alice","shell":"/bin/bash","uid":10001}})";
 
-// Stands in for cache-kest on 127.0.0.1: answers one connection per answer, in order, and keeps the
-// function names it was asked for. Nothing answers once the answers are used up.
-struct StandIn {
-    explicit StandIn(const QList<QByteArray> &answers)
-    {
-        sockaddr_in address {};
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        socklen_t length = sizeof(address);
-        bind(fd, reinterpret_cast<sockaddr *>(&address), length);
-        listen(fd, 4);
-        getsockname(fd, reinterpret_cast<sockaddr *>(&address), &length);
-        port = ntohs(address.sin_port);
-        thread = std::thread([this, answers]() {
-            for (const QByteArray &answer : answers) {
-                const int connection = accept(fd, nullptr, nullptr);
-                if (connection < 0)
-                    return;
-                char buffer[4096];
-                const ssize_t got = recv(connection, buffer, sizeof(buffer), 0);
-                const QJsonObject request
-                    = QJsonDocument::fromJson(QByteArray(buffer, int(qMax<ssize_t>(got, 4))).mid(4)).object();
-                asked.append(request.value(QLatin1String("functionName")).toString().toUtf8());
-                const QByteArray reply = CacheDaemonFixture::frame(answer);
-                send(connection, reply.constData(), size_t(reply.size()), MSG_NOSIGNAL);
-                close(connection);
-            }
-        });
-    }
-    ~StandIn() { close(fd); }
-    // What it was asked, once nobody can ask any more.
-    QByteArray finish()
-    {
-        shutdown(fd, SHUT_RDWR);
-        thread.join();
-        return asked.join(' ');
-    }
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    quint16 port = 0;
-    QList<QByteArray> asked;
-    std::thread thread;
-};
+// The function names a stand-in daemon was asked for, once nobody can ask any more.
+QByteArray askedOf(LoopbackPeer &peer)
+{
+    QList<QByteArray> names;
+    for (const QByteArray &request : peer.finish())
+        names.append(
+            QJsonDocument::fromJson(request.mid(4)).object().value(QLatin1String("functionName")).toString().toUtf8());
+    return names.join(' ');
+}
 
 template<typename Function> Function symbol(void *module, const char *name)
 {
@@ -227,12 +193,15 @@ private Q_SLOTS:
         // A trailing comma and a line of three fields, as the daemon's writer may leave them.
         QVERIFY(root.writeFile(QStringLiteral("/var/lib/libkest-iam/groups.txt"),
             "sudo:x:27:admin,@alice\nkest:x:10000:@alice,@bob\nbroken:x:5000\nlpadmin:x:5001:@alice,\n"));
-        StandIn standIn(answers);
+        QList<QByteArray> framed;
+        for (const QByteArray &answer : answers)
+            framed.append(CacheDaemonFixture::frame(answer));
+        LoopbackPeer standIn(framed);
         if (!answers.isEmpty())
             QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"),
-                QByteArray::number(m_namedCacheKest.processId()) + '\n' + QByteArray::number(standIn.port) + '\n'));
+                QByteArray::number(m_namedCacheKest.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
         const QByteArray result = callNss(call, key, bufferSize);
-        QTEST(standIn.finish(), "asked");
+        QTEST(askedOf(standIn), "asked");
         QTEST(result, "result");
     }
 
