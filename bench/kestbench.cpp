@@ -1,4 +1,5 @@
-// kest-bench: latencies of cache-kest against floors measured in the same run (run by tools/bench.sh).
+// kest-bench: latencies of cache-kest against floors measured in the same run, sample by sample (run by
+// tools/bench.sh).
 #include "blackhole.h"
 #include "cachecontrolfactory.h"
 #include "cachecontrolinterface.h"
@@ -62,14 +63,28 @@ bool roundTrip(quint16 port, const QByteArray &frame, QByteArray *reply = nullpt
     return length >= 4;
 }
 
-QList<double> measure(int count, const std::function<void()> &action)
+// A floor is sampled alongside the rows held against it, one of its samples before each of theirs, so
+// that both see the same load of a shared machine.
+struct Floor {
+    Row row;
+    std::function<void()> action;
+};
+
+double timed(const std::function<void()> &action)
+{
+    QElapsedTimer timer;
+    timer.start();
+    action();
+    return double(timer.nsecsElapsed()) / 1e6;
+}
+
+QList<double> measure(int count, const std::function<void()> &action, Floor *floor = nullptr)
 {
     QList<double> samples;
     for (int i = 0; i < count; ++i) {
-        QElapsedTimer timer;
-        timer.start();
-        action();
-        samples << double(timer.nsecsElapsed()) / 1e6;
+        if (floor)
+            floor->row.samples << timed(floor->action);
+        samples << timed(action);
     }
     return samples;
 }
@@ -130,7 +145,7 @@ QSslConfiguration tlsOf(const DomainServerFixture &server)
 }
 
 // getpwnam_r through the built name-service module, the way glibc calls it.
-QList<Row> moduleRows(const QString &floor)
+QList<Row> moduleRows(Floor &floor)
 {
     using GetPwNam = int (*)(const char *, passwd *, char *, size_t, int *);
     const QByteArray path = QFile::encodeName(
@@ -148,7 +163,9 @@ QList<Row> moduleRows(const QString &floor)
         getpwnam(name, &entry, buffer, sizeof(buffer), &error);
     };
     QList<Row> rows { { QStringLiteral("getpwnam_r through the module, cached account"),
-        measure(200, [&] { lookUp("@alice"); }), floor } };
+        measure(
+            200, [&] { lookUp("@alice"); }, &floor),
+        floor.row.name } };
     // A local name is turned away before any I/O: thousands of calls per sample show it costs no system call.
     rows << Row { QStringLiteral("getpwnam_r through the module, local name (per 1000 calls)"),
         measure(200,
@@ -156,7 +173,7 @@ QList<Row> moduleRows(const QString &floor)
                 for (int i = 0; i < 1000; ++i)
                     lookUp("root");
             }),
-        floor };
+        floor.row.name };
     dlclose(module);
     return rows;
 }
@@ -232,7 +249,7 @@ QList<Row> frontServiceRows(int count, uint lastUid, QStringList &notes)
 }
 
 // Both daemons over many cached accounts; the server is never reachable here.
-QList<Row> scaleRows(int count, const QString &floor, QStringList &notes)
+QList<Row> scaleRows(int count, Floor &floor, QStringList &notes)
 {
     const uint firstUid = 20000;
     TestRoot root;
@@ -258,10 +275,14 @@ QList<Row> scaleRows(int count, const QString &floor, QStringList &notes)
     const QByteArray lookUp = call("queryAccountName", { name });
     const QByteArray login = call("authenticatePassword", { name, QStringLiteral("pw") });
     roundTrip(daemon.port(), lookUp);
-    rows << Row { QStringLiteral("look-up, offline") + label, measure(200, [&] { roundTrip(daemon.port(), lookUp); }),
-        floor };
-    rows << Row { QStringLiteral("login, offline") + label, measure(200, [&] { roundTrip(daemon.port(), login); }),
-        floor };
+    rows << Row { QStringLiteral("look-up, offline") + label,
+        measure(
+            200, [&] { roundTrip(daemon.port(), lookUp); }, &floor),
+        floor.row.name };
+    rows << Row { QStringLiteral("login, offline") + label,
+        measure(
+            200, [&] { roundTrip(daemon.port(), login); }, &floor),
+        floor.row.name };
     notes << QStringLiteral("cache-kest RSS with %1 records: ").arg(count) + rssOf(daemon.processId());
     return rows;
 }
@@ -309,16 +330,14 @@ int main(int argc, char *argv[])
         QTextStream(stderr) << "cannot start cache-kest: " << daemon.errorText() << Qt::endl;
         return 1;
     }
-    const QString loopback = QStringLiteral("floor: framed loopback round trip");
-    const QString kept = QStringLiteral("floor: HTTPS request, kept-alive connection");
-    const QString fresh = QStringLiteral("floor: HTTPS request, new TLS connection");
     const QByteArray lookUp = call("queryAccountName", { QStringLiteral("@alice") });
     const QByteArray login
         = call("authenticatePassword", { QStringLiteral("@alice"), QStringLiteral("alice-password") });
     QList<Row> rows;
 
     EchoServer echo;
-    rows << Row { loopback, measure(count, [&] { roundTrip(echo.port(), lookUp); }), QString() };
+    Floor loopback { { QStringLiteral("floor: framed loopback round trip"), {}, QString() },
+        [&] { roundTrip(echo.port(), lookUp); } };
     const DomainEndpoint endpoint = endpointOf(server);
     const QSslConfiguration tls = tlsOf(server);
     const QByteArray request = "GET /v1/domain/ HTTP/1.1\r\nHost: " + DomainServerFixture::address().toUtf8() + ':'
@@ -328,8 +347,9 @@ int main(int argc, char *argv[])
     const auto exchange
         = [&request](DomainConnection &over) { over.exchange(request, QDeadlineTimer(5000), QDeadlineTimer(5000)); };
     exchange(connection);
-    rows << Row { kept, measure(count, [&] { exchange(connection); }), QString() };
-    rows << Row { fresh,
+    Floor kept { { QStringLiteral("floor: HTTPS request, kept-alive connection"), {}, QString() },
+        [&] { exchange(connection); } };
+    rows << Row { QStringLiteral("floor: HTTPS request, new TLS connection"),
         measure(count / 4,
             [&] {
                 DomainConnection once;
@@ -339,27 +359,38 @@ int main(int argc, char *argv[])
         QString() };
 
     roundTrip(daemon.port(), login);
-    rows << Row { QStringLiteral("look-up, online"), measure(count, [&] { roundTrip(daemon.port(), lookUp); }), kept };
-    rows << Row { QStringLiteral("login, online"), measure(count, [&] { roundTrip(daemon.port(), login); }), kept };
+    rows << Row { QStringLiteral("look-up, online"),
+        measure(
+            count, [&] { roundTrip(daemon.port(), lookUp); }, &kept),
+        kept.row.name };
+    rows << Row { QStringLiteral("login, online"),
+        measure(
+            count, [&] { roundTrip(daemon.port(), login); }, &kept),
+        kept.row.name };
 
     server.stop();
     roundTrip(daemon.port(), lookUp);
-    rows << Row { QStringLiteral("look-up, offline"), measure(count, [&] { roundTrip(daemon.port(), lookUp); }),
-        loopback };
-    rows << Row { QStringLiteral("login, offline"), measure(count, [&] { roundTrip(daemon.port(), login); }),
-        loopback };
+    rows << Row { QStringLiteral("look-up, offline"),
+        measure(
+            count, [&] { roundTrip(daemon.port(), lookUp); }, &loopback),
+        loopback.row.name };
+    rows << Row { QStringLiteral("login, offline"),
+        measure(
+            count, [&] { roundTrip(daemon.port(), login); }, &loopback),
+        loopback.row.name };
     const QString rss = rssOf(daemon.processId());
     rows << moduleRows(loopback);
 
     // A new outage per daemon start: the first call finds the server silent, the others know it.
-    Row first { QStringLiteral("look-up, server blackholed: first call"), {}, loopback };
-    Row following { QStringLiteral("look-up, server blackholed: following calls"), {}, loopback };
+    Row first { QStringLiteral("look-up, server blackholed: first call"), {}, loopback.row.name };
+    Row following { QStringLiteral("look-up, server blackholed: following calls"), {}, loopback.row.name };
     Blackhole blackhole(DomainServerFixture::address(), server.port());
     for (int run = 0; run < 3 && blackhole.isFull(); ++run) {
         daemon.stop();
         daemon.start();
         first.samples << measure(1, [&] { roundTrip(daemon.port(), lookUp); });
-        following.samples << measure(count / 3, [&] { roundTrip(daemon.port(), lookUp); });
+        following.samples << measure(
+            count / 3, [&] { roundTrip(daemon.port(), lookUp); }, &loopback);
     }
     rows << first << following;
     daemon.stop();
@@ -369,6 +400,8 @@ int main(int argc, char *argv[])
             .arg(first.samples.size()) };
     for (const int count : { 1000, 10000 })
         rows << scaleRows(count, loopback, notes);
+    rows.prepend(kept.row);
+    rows.prepend(loopback.row);
     print(rows, notes);
     return 0;
 }

@@ -73,11 +73,11 @@ void log_message(int level, const char *file, int line, const char *function, co
 
     /* The finished text is handed on through "%s" so that a "%" in the body is never interpreted. */
     if (user != NULL)
-        snprintf(text, LINE_SIZE - 2, "%s process: %s(%u), user: %s(%u,%u, %u,%u), %s, %u, %s, %s ", timestamp,
-                 process, pid, user, uid, euid, gid, egid, file, (unsigned int)line, function, body);
+        snprintf(text, LINE_SIZE - 2, "%s process: %s(%u), user: %s(%u,%u, %u,%u), %s, %u, %s, %s ", timestamp, process,
+            pid, user, uid, euid, gid, egid, file, (unsigned int)line, function, body);
     else
         snprintf(text, LINE_SIZE - 2, "%s process: %s(%u), user: %u,%u, %u,%u, %s, %u, %s, %s  ", timestamp, process,
-                 pid, uid, euid, gid, egid, file, (unsigned int)line, function, body);
+            pid, uid, euid, gid, egid, file, (unsigned int)line, function, body);
 
     syslog(level, "%s", text);
     if (level <= 4)
@@ -126,8 +126,8 @@ static int process_name_in(const char *const *names, size_t count, int unreadabl
 
 int is_trusted_caller(void)
 {
-    static const char *const names[] = { "systemd-logind", "systemd-coredump", "systemd-journald",
-                                         "accounts-daemon", "sudo", "cache-kest" };
+    static const char *const names[]
+        = { "systemd-logind", "systemd-coredump", "systemd-journald", "accounts-daemon", "sudo", "cache-kest" };
     return process_name_in(names, COUNT_OF(names), 1);
 }
 
@@ -190,16 +190,11 @@ int read_pid_file(char *out)
     return length > 0 ? 1 : 0;
 }
 
-int is_cache_daemon_running(void)
+/* 1 when /proc/<pid>/cmdline names the cache daemon. */
+static int is_cache_daemon_pid(const char *pid)
 {
     static const char daemon_name[] = "cache-kest";
     const size_t name_length = sizeof(daemon_name) - 1;
-    char pid[PID_TEXT_SIZE];
-    memset(pid, 0, sizeof(pid));
-    /* Without a pid "/proc//cmdline" would name the kernel's command line. */
-    if (!read_pid_file(pid))
-        return 0;
-
     char buffer[CMDLINE_READ_SIZE];
     memset(buffer, 0, sizeof(buffer));
     snprintf(buffer, sizeof(buffer), "/proc/%s/cmdline", pid);
@@ -217,6 +212,52 @@ int is_cache_daemon_running(void)
 
     size_t length = strlen(buffer);
     return length > name_length - 1 && strcmp(buffer + length - name_length, daemon_name) == 0 ? 1 : 0;
+}
+
+int is_cache_daemon_running(void)
+{
+    char pid[PID_TEXT_SIZE];
+    memset(pid, 0, sizeof(pid));
+    /* Without a pid "/proc//cmdline" would name the kernel's command line. */
+    if (!read_pid_file(pid))
+        return 0;
+    return is_cache_daemon_pid(pid);
+}
+
+static int parse_port(char *text, unsigned short *port)
+{
+    size_t length = strlen(text);
+    while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
+        text[--length] = '\0';
+    if (length == 0)
+        return 0;
+    for (size_t i = 0; i < length; ++i) {
+        if (text[i] < '0' || text[i] > '9')
+            return 0;
+    }
+    *port = (unsigned short)strtoul(text, NULL, 10);
+    return 1;
+}
+
+int cache_daemon_port(unsigned short *port)
+{
+    char path[PATH_MAX_TEXT];
+    if (port == NULL || !cache_pid_path(path, sizeof(path)))
+        return 0;
+    int fd = open(path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0)
+        return 0;
+    char text[2 * PID_TEXT_SIZE];
+    ssize_t got = read(fd, text, sizeof(text) - 1);
+    close(fd);
+    if (got <= 0)
+        return 0;
+    text[got] = '\0';
+    char *newline = strchr(text, '\n');
+    if (newline == NULL || newline == text)
+        return 0;
+    *newline = '\0';
+    return is_cache_daemon_pid(text) && parse_port(newline + 1, port);
 }
 
 int is_connect(int socket)
@@ -257,7 +298,7 @@ static int fail_connection(const char *function, int socket, int line, const cha
 }
 
 /* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
-static int send_query(const char *function, const void *request, size_t request_length)
+static int send_query(const char *function, unsigned short port, const void *request, size_t request_length)
 {
     int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
@@ -267,8 +308,7 @@ static int send_query(const char *function, const void *request, size_t request_
     memset(&address, 0, sizeof(address));
     address.sin_family = AF_INET;
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    unsigned short port = 0;
-    if (!pid_file_exists() || !read_port(&port))
+    if (port == 0 && (!pid_file_exists() || !read_port(&port)))
         return fail_connection(function, fd, 297, "read port failed, code: %d, detail: %s");
     address.sin_port = htons(port);
 
@@ -288,7 +328,7 @@ static int send_query(const char *function, const void *request, size_t request_
 
 int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
 {
-    int fd = send_query("socket_query", request, request_length);
+    int fd = send_query("socket_query", 0, request, request_length);
     if (fd < 0)
         return 0;
     ssize_t received = recv(fd, reply, reply_capacity, 0);
@@ -351,12 +391,18 @@ static int receive_all(int fd, unsigned char *buffer, size_t length, const struc
 int socket_query_frame(
     const void *request, size_t request_length, char **reply, size_t *reply_length, size_t max_length)
 {
+    return socket_query_frame_to(0, request, request_length, reply, reply_length, max_length);
+}
+
+int socket_query_frame_to(unsigned short port, const void *request, size_t request_length, char **reply,
+    size_t *reply_length, size_t max_length)
+{
     static const char function[] = "socket_query_frame";
     static const char failed[] = "receive message failed, code: %d, detail: %s";
     if (reply == NULL)
         return 0;
     *reply = NULL;
-    int fd = send_query(function, request, request_length);
+    int fd = send_query(function, port, request, request_length);
     if (fd < 0)
         return 0;
 
@@ -406,16 +452,5 @@ int read_port(unsigned short *port)
             memcpy(kept, line, sizeof(kept));
     }
     fclose(file);
-
-    size_t length = strlen(kept);
-    while (length > 0 && (kept[length - 1] == '\n' || kept[length - 1] == '\r'))
-        kept[--length] = '\0';
-    if (length == 0)
-        return 0;
-    for (size_t i = 0; i < length; ++i) {
-        if (kept[i] < '0' || kept[i] > '9')
-            return 0;
-    }
-    *port = (unsigned short)strtoul(kept, NULL, 10);
-    return 1;
+    return parse_port(kept, port);
 }

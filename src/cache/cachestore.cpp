@@ -1,5 +1,6 @@
 #include "cachestore.h"
 
+#include "fileversion.h"
 #include "kestpaths.h"
 
 #include <QDebug>
@@ -7,7 +8,10 @@
 #include <QDirIterator>
 #include <QFile>
 #include <QFileInfo>
+#include <QHash>
 #include <QRegularExpression>
+
+#include <mutex>
 
 #include <cerrno>
 #include <unistd.h>
@@ -31,19 +35,37 @@ QFileInfoList regularFiles()
     return QDir(workDir()).entryInfoList(QDir::Files | QDir::NoSymLinks | QDir::NoDotAndDotDot, QDir::Unsorted);
 }
 
-CacheControlPtr recordHolding(quint32 uid, const QString &account)
+// Records read for answers, kept while their files stay the same: a look-up or login of a cached
+// account then costs one stat instead of reading and checking the file again.
+struct ReadRecords {
+    struct Entry {
+        FileVersion version;
+        CacheControlPtr record;
+    };
+    std::mutex mutex;
+    QHash<quint32, Entry> entries;
+};
+constexpr int kReadRecordsKept = 256;
+// Well above the tick of the file system's time stamps.
+constexpr int kSettleMs = 100;
+
+ReadRecords &readRecords()
 {
-    CacheControlPtr record = createCacheControl();
-    record->setUid(uid);
-    loadCacheRecord(record);
-    return record && record->account() == account ? record : CacheControlPtr();
+    static ReadRecords instance;
+    return instance;
 }
 
-// Under the rules of the listing, so that a known uid finds nothing the listing would skip.
-bool isRecordFile(quint32 uid)
+void forgetReadRecord(quint32 uid)
 {
-    const QFileInfo file(cacheFilePathOfUid(uid));
-    return file.isFile() && !file.isSymLink();
+    ReadRecords &kept = readRecords();
+    std::lock_guard<std::mutex> lock(kept.mutex);
+    kept.entries.remove(uid);
+}
+
+CacheControlPtr recordHolding(quint32 uid, const QString &account)
+{
+    const CacheControlPtr record = readCacheRecord(uid);
+    return record && record->account() == account ? record : CacheControlPtr();
 }
 
 bool isDomainUserFileName(const QString &name)
@@ -82,6 +104,7 @@ bool cacheFileExists(const CacheControlInterface &record)
 
 bool saveCacheRecord(CacheControlInterface &record)
 {
+    forgetReadRecord(record.uid());
     return record.writeToFile(cacheFilePath(record));
 }
 
@@ -99,6 +122,34 @@ bool loadCacheRecord(CacheControlPtr &record)
         record->setUid(uid);
     }
     return record->readFromFile(path);
+}
+
+CacheControlPtr readCacheRecord(quint32 uid)
+{
+    const QString path = cacheFilePathOfUid(uid);
+    // Not followed: the listing skips links, so a link must not answer here either.
+    const FileVersion version = FileVersion::of(path, false);
+    if (!version.isRegularFile())
+        return CacheControlPtr();
+    const bool settled = !version.isRecent(kSettleMs);
+    ReadRecords &kept = readRecords();
+    {
+        std::lock_guard<std::mutex> lock(kept.mutex);
+        const auto entry = kept.entries.constFind(uid);
+        if (entry != kept.entries.cend() && entry->version == version)
+            return entry->record;
+    }
+    CacheControlPtr record = createCacheControl();
+    record->setUid(uid);
+    if (!loadCacheRecord(record) || !record)
+        return CacheControlPtr();
+    if (!settled)
+        return record;
+    std::lock_guard<std::mutex> lock(kept.mutex);
+    if (kept.entries.size() >= kReadRecordsKept)
+        kept.entries.clear();
+    kept.entries.insert(uid, { version, record });
+    return record;
 }
 
 bool cacheRecordFromJson(CacheControlPtr &record, const QString &json)
@@ -158,7 +209,7 @@ QList<quint32> listCacheUids()
 bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUid, CacheControlPtr *found)
 {
     uid = 0;
-    CacheControlPtr record = knownUid != 0 && isRecordFile(knownUid) ? recordHolding(knownUid, account) : nullptr;
+    CacheControlPtr record = knownUid != 0 ? recordHolding(knownUid, account) : nullptr;
     if (record)
         uid = knownUid;
     const QStringList paths = record ? QStringList() : listCacheFiles();
@@ -176,6 +227,7 @@ bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUi
 
 void removeCacheFile(quint32 uid)
 {
+    forgetReadRecord(uid);
     const QString path = cacheFilePathOfUid(uid);
     if (QFile::exists(path))
         QFile::remove(path);

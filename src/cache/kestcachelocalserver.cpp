@@ -5,6 +5,7 @@
 #include "kestpaths.h"
 #include "passwordpolicy.h"
 #include "peeruid.h"
+#include "settingsfile.h"
 
 #include <QDebug>
 #include <QFile>
@@ -133,6 +134,7 @@ void KestCacheLocalServer::watchPartialFrame(QTcpSocket *socket)
 
 void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &payload)
 {
+    const SettingsFile::OneLook settingsOnce;
     QJsonParseError error;
     const QJsonDocument document = QJsonDocument::fromJson(payload, &error);
     if (error.error != QJsonParseError::NoError || !document.isObject()) {

@@ -33,10 +33,8 @@ CacheControlPtr shownAccount(uint uid)
 {
     if (uid < firstDomainUid)
         return CacheControlPtr();
-    CacheControlPtr record = createCacheControl();
-    record->setUid(uid);
-    if (!loadCacheRecord(record) || !record || record->uid() != uid || record->account().isEmpty()
-        || record->removeStatus() != 0)
+    const CacheControlPtr record = readCacheRecord(uid);
+    if (!record || record->uid() != uid || record->account().isEmpty() || record->removeStatus() != 0)
         return CacheControlPtr();
     return record;
 }

@@ -6,6 +6,7 @@
 #include "json-reader.h"
 
 #include <arpa/inet.h>
+#include <pthread.h>
 #include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
@@ -16,13 +17,27 @@
 /* A listing of every cached account is the longest reply; far below this even for many thousands. */
 #define REPLY_LIMIT (64 * 1024 * 1024)
 
-int kest_daemon_reachable(void)
+static pthread_once_t self_once = PTHREAD_ONCE_INIT;
+static int self_is_daemon;
+
+/* A process keeps its name for the module's life: an exec loads the module afresh. */
+static void find_self(void)
 {
     char process[PROCESS_NAME_SIZE];
     memset(process, 0, sizeof(process));
-    if (get_process_name(process) && strcmp(process, "cache-kest") == 0)
-        return 0;
-    return is_cache_daemon_running();
+    self_is_daemon = get_process_name(process) && strcmp(process, "cache-kest") == 0;
+}
+
+static int daemon_port(unsigned short *port)
+{
+    pthread_once(&self_once, find_self);
+    return !self_is_daemon && cache_daemon_port(port);
+}
+
+int kest_daemon_reachable(void)
+{
+    unsigned short port = 0;
+    return daemon_port(&port);
 }
 
 static int append_raw(char *out, size_t size, size_t *length, const char *text)
@@ -92,11 +107,12 @@ static size_t build_request(char *out, size_t size, const char *function, const 
 int kest_call(const char *function, const char *const *argv, size_t argc, char **reply)
 {
     *reply = NULL;
-    if (!kest_daemon_reachable())
+    unsigned short port = 0;
+    if (!daemon_port(&port))
         return 0;
     char request[REQUEST_SIZE];
     size_t length = build_request(request, sizeof(request), function, argv, argc);
-    int answered = length > 0 && socket_query_frame(request, length, reply, NULL, REPLY_LIMIT);
+    int answered = length > 0 && socket_query_frame_to(port, request, length, reply, NULL, REPLY_LIMIT);
     explicit_bzero(request, sizeof(request));
     if (length == 0)
         log_message(3, SOURCE_PATH, __LINE__, __func__, "request %s too long for cache-kest", function);

@@ -3,6 +3,7 @@
 #include "globalsetting.h"
 #include "kestpaths.h"
 #include "serverreachability.h"
+#include "settingsfile.h"
 
 #include <QDebug>
 #include <QFile>
@@ -146,7 +147,7 @@ QDeadlineTimer HttpHelper::requestDeadline(int milliseconds) const
 
 bool HttpHelper::checkServerAddress(QString &hostPort, const std::atomic<bool> *cancel)
 {
-    if (!QFile::exists(KestPaths::settingsFile())) {
+    if (!SettingsFile::exists()) {
         warn(QStringLiteral("configuration file is broken."));
         return false;
     }
@@ -285,7 +286,7 @@ bool HttpHelper::exchange(
 {
     failure = unreachableReply();
     m_lastAnswered = false;
-    if (!QFile::exists(KestPaths::settingsFile())) {
+    if (!SettingsFile::exists()) {
         warn(QStringLiteral("configuration file is broken."));
         return false;
     }

@@ -11,4 +11,16 @@ class SettingsFile
 public:
     // As QSettings in INI form reads "group/key", default included.
     static QVariant value(const QString &group, const QString &key, const QVariant &defaultValue = QVariant());
+    static bool exists();
+
+    // While one lives on a thread, that thread looks at the file once: one request answered under one
+    // version of the settings, for the price of one stat.
+    class OneLook
+    {
+    public:
+        OneLook();
+        ~OneLook();
+        OneLook(const OneLook &) = delete;
+        OneLook &operator=(const OneLook &) = delete;
+    };
 };

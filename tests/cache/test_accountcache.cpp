@@ -9,6 +9,7 @@
 #include <QJsonArray>
 #include <QJsonObject>
 #include <QTest>
+#include <QThread>
 #include <QtEndian>
 
 #include <atomic>
@@ -221,6 +222,24 @@ private Q_SLOTS:
         QVERIFY(listCacheFiles().isEmpty());
         ::cleanDomainUserCacheFiles();
         QCOMPARE(logged(), QStringList { QStringLiteral("service working directory is not exists.") });
+    }
+
+    // A record kept from an earlier read must give way to any later change of its file, the same size
+    // included, and a link put in its place answers nothing.
+    void readCacheRecordSeesChanges()
+    {
+        QFile file(at("10001"));
+        QVERIFY(put("10001", recordFile()) && file.open(QIODevice::ReadOnly)
+            && file.setFileTime(QDateTime::currentDateTime().addSecs(-60), QFileDevice::FileModificationTime));
+        // Past the time within which a file's time stamps may not show a further change.
+        QThread::msleep(150);
+        QCOMPARE(readCacheRecord(10001)->removeStatus(), 0u);
+        QCOMPARE(readCacheRecord(10001)->removeStatus(), 0u);
+        QVERIFY(put("10001", recordFile(10001, "@alice", 1)));
+        QCOMPARE(readCacheRecord(10001)->removeStatus(), 1u);
+        QVERIFY(put("other", recordFile(10001, "@alice", 2)) && QFile::remove(at("10001"))
+            && QFile::link(at("other"), at("10001")));
+        QVERIFY(readCacheRecord(10001).isNull());
     }
 
     void checkOfflineLogin_data()
