@@ -9,7 +9,6 @@
 #include "testroot.h"
 
 #include <QDBusConnectionInterface>
-#include <QDBusInterface>
 #include <QDBusVariant>
 #include <QDBusVirtualObject>
 #include <QDir>
@@ -59,13 +58,12 @@ bool writeRecord(uint uid, const QString &name, uint removeStatus = 0)
         && saveCacheRecord(*record);
 }
 
-QList<uint> cachedUids()
+// The arguments of logind's SessionNew.
+QVariantList sessionNew(const char *session)
 {
-    QList<uint> uids = listCacheUids();
-    std::sort(uids.begin(), uids.end());
-    return uids;
+    return { QLatin1String(session),
+        QVariant::fromValue(QDBusObjectPath(kLogind + QStringLiteral("/session/") + QLatin1String(session))) };
 }
-
 } // namespace
 
 // logind, the accounts daemon and the lock service: each call is recorded ("KillSession c2 all 9") and answered.
@@ -97,16 +95,15 @@ public:
         peerCalls.append(call.join(QLatin1Char(' ')));
         if (refusedMembers.split(QLatin1Char(' ')).contains(member))
             return connection.send(message.createErrorReply(QDBusError::Failed, member + QStringLiteral(" refused")));
+        if (member != QLatin1String("ListSessions"))
+            return connection.send(message.createReply());
         SessionList sessions;
-        const uint uids[] { 10001, 10002, 113, 1000 };
-        for (int i = 0; i < 4; ++i) {
-            const QString id = QStringLiteral("c") + QString::number(i + 1);
-            sessions.append({ id, uids[i], users[i], QStringLiteral("seat0"),
+        for (const uint uid : { 10001, 10002, 113, 1000 }) {
+            const QString id = QStringLiteral("c") + QString::number(sessions.size() + 1);
+            sessions.append({ id, uid, users[sessions.size()], QStringLiteral("seat0"),
                 QDBusObjectPath(kLogind + QStringLiteral("/session/") + id) });
         }
-        return connection.send(member == QLatin1String("ListSessions")
-                ? message.createReply(QVariant::fromValue(sessions))
-                : message.createReply());
+        return connection.send(message.createReply(QVariant::fromValue(sessions)));
     }
 };
 
@@ -176,19 +173,6 @@ private Q_SLOTS:
         }
     }
 
-    // A new session rebuilds the per-user objects, unless it is the greeter's; a disabled service has none.
-    void userObjectsFollowSessions()
-    {
-        QVERIFY(writeRecord(10004, QStringLiteral("@dave")));
-        announce("c3");
-        QVERIFY(!userProperty(10004, "Uid").isValid());
-        announce("c4");
-        QCOMPARE(userProperty(10004, "Uid"), QVariant(10004u));
-        QVERIFY(m_root.writeSettings(kOff));
-        announce("c1");
-        QVERIFY(!userProperty(10001, "Uid").isValid());
-    }
-
     // The service object in this process, so that its warnings can be read back. A row's name starts with its
     // steps: Enable written ("on", "off"), the settings disabled or removed ("disabled", "unset"), or a method
     // called with the row's arguments through this connection, which answers it itself.
@@ -200,13 +184,14 @@ private Q_SLOTS:
         QTest::addColumn<QStringList>("trace"); // the stand-ins' calls (DeleteUser sorted), then the warnings
         QTest::addColumn<QList<uint>>("remaining");
         QTest::addColumn<quint32>("status"); // of 10002's record; ~0: none
+        QTest::addColumn<bool>("object"); // 10002's is still up
         QTest::addColumn<QByteArray>("settings"); // afterwards
         const auto row = [](const QByteArray &name, const QVariantList &arguments, const char *refused,
                              const QVariant &reply, const QByteArray &trace, const QList<uint> &remaining,
-                             quint32 status, const QByteArray &settings) {
+                             quint32 status, bool object, const QByteArray &settings) {
             QTest::newRow(name.constData()) << arguments << QString::fromLatin1(refused) << reply
                                             << QString::fromUtf8(trace).split(QLatin1Char('\n'), Qt::SkipEmptyParts)
-                                            << remaining << status << settings;
+                                            << remaining << status << object << settings;
         };
         const QList<uint> all { 1005, 10001, 10002 };
         const QByteArray sweep("ListSessions\nKillSession c2 all 9\nKillSession c3 all 9\nKillSession c4 all 9");
@@ -214,31 +199,36 @@ private Q_SLOTS:
             const QByteArray state = on ? "" : "disabled ";
             const QByteArray settings = on ? kOn : kOff;
             // Once the cache is changed, the sessions of users without a record end.
-            row(state + "RemoveCacheFile", { 10002u }, "", true, on ? sweep : "", { 1005, 10001 }, ~0u, settings);
+            row(state + "RemoveCacheFile", { 10002u }, "", true, on ? sweep : "", { 1005, 10001 }, ~0u, true, settings);
             row(state + "RemoveCacheFilesNotInList", { QVariant::fromValue(QList<uint> { 10001 }) }, "", true,
-                on ? sweep : "", { 10001 }, ~0u, settings);
+                on ? sweep : "", { 10001 }, ~0u, true, settings);
             row(state + "RemoveAllCacheFiles", {}, "", true,
-                on ? sweep.left(12) + "\nKillSession c1 all 9" + sweep.mid(12) : "", {}, ~0u, settings);
-            row(state + "DisableTerminal", { 10002u }, "", on, "", all, on ? 1 : 0, settings);
+                on ? sweep.left(12) + "\nKillSession c1 all 9" + sweep.mid(12) : "", {}, ~0u, false, settings);
+            row(state + "DisableTerminal", { 10002u }, "", on, "", all, on ? 1 : 0, true, settings);
             row(state + "GetUserGroups", { QStringLiteral("@alice") }, "",
-                on ? QStringList { QStringLiteral("kest"), QStringLiteral("lp") } : QStringList(), "", all, 0,
+                on ? QStringList { QStringLiteral("kest"), QStringLiteral("lp") } : QStringList(), "", all, 0, true,
                 settings);
         }
-        row("DisableTerminal, no record", { 20000u }, "", true, "", all, 0, kOn);
+        row("DisableTerminal, no record", { 20000u }, "", true, "", all, 0, true, kOn);
         row("RemoveCacheFile, session list refused", { 10002u }, "ListSessions", true,
-            "ListSessions\n[ syncLightDM ] call systemd-logind.  ListSessions refused", { 1005, 10001 }, ~0u, kOn);
+            "ListSessions\n[ syncLightDM ] call systemd-logind.  ListSessions refused", { 1005, 10001 }, ~0u, true,
+            kOn);
         row("RemoveCacheFile, kills refused", { 10002u }, "KillSession", true,
             sweep + QByteArray("\n[ syncLightDM ] terminate session failed.  KillSession refused").repeated(3),
-            { 1005, 10001 }, ~0u, kOn);
+            { 1005, 10001 }, ~0u, true, kOn);
         const QByteArray off("DeleteUser @alice true\nDeleteUser @bob true\nSwitchToUser {\"Type\":0,\"Uid\":0}\n");
-        row("off off on", {}, "", QVariant(), off + "already in destination status.", { 1005 }, ~0u, kOn);
+        row("off off on", {}, "", QVariant(), off + "already in destination status.", { 1005 }, ~0u, true, kOn);
         row("unset off", {}, "", QVariant(),
-            "critical error. cannot read configuration file " + m_root.filePath(kSettings).toUtf8(), all, 0,
+            "critical error. cannot read configuration file " + m_root.filePath(kSettings).toUtf8(), all, 0, true,
             QByteArray());
         row("off, accounts daemon and lock service refuse", {}, "DeleteUser SwitchToUser", QVariant(),
             off + QByteArray("delete user data failed. error: DeleteUser refused\n").repeated(2)
                 + "call ose-lockservice failed.",
-            all, 0, kOff);
+            all, 0, true, kOff);
+        // A new session rebuilds the per-user objects (none while disabled), unless it is the greeter's.
+        row("disabled SessionNew, a user's", sessionNew("c1"), "", QVariant(), "[GetUserIdList]: enable false", all, 0,
+            false, kOff);
+        row("disabled SessionNew, the greeter's", sessionNew("c3"), "", QVariant(), "", all, 0, true, kOff);
     }
 
     void service()
@@ -249,6 +239,7 @@ private Q_SLOTS:
         QFETCH(QStringList, trace);
         QFETCH(QList<uint>, remaining);
         QFETCH(quint32, status);
+        QFETCH(bool, object);
         QFETCH(QByteArray, settings);
 
         QVERIFY(writeRecord(1005, QStringLiteral("localuser")));
@@ -278,12 +269,13 @@ private Q_SLOTS:
                 asked.append(QString::fromUtf8(line.text.mid(line.text.indexOf(", ") + 2)));
         QCOMPARE(last, reply);
         QCOMPARE(asked, trace);
-        QCOMPARE(cachedUids(), remaining);
+        QList<uint> uids = listCacheUids();
+        std::sort(uids.begin(), uids.end());
+        QCOMPARE(uids, remaining);
         CacheControlPtr record = createCacheControl();
         record->setUid(10002);
         QCOMPARE(loadCacheRecord(record) && record ? record->removeStatus() : ~0u, status);
-        QCOMPARE(bus.objectRegisteredAt(kPath + QStringLiteral("/user10002")) != nullptr,
-            !steps.endsWith(QLatin1String("RemoveAllCacheFiles")));
+        QCOMPARE(bus.objectRegisteredAt(kPath + QStringLiteral("/user10002")) != nullptr, object);
         QCOMPARE(m_root.readFile(kSettings), settings);
     }
 
@@ -315,6 +307,8 @@ private Q_SLOTS:
     // Through the real cache-kest client, the cache daemon and the test domain server.
     void passwordChange()
     {
+        const QVariantList change { QStringLiteral("@alice"), QStringLiteral("alice-password"), QStringLiteral("new") };
+        QCOMPARE(call(QStringLiteral("ModifyUserPassword"), change), QVariant(QString())); // no client yet
         DomainServerFixture server;
         QVERIFY2(server.isValid() && server.start(), qPrintable(server.errorText()));
         QVERIFY(m_root.writeSettings(server.settingsIni(
@@ -327,8 +321,7 @@ private Q_SLOTS:
             "#!/bin/sh\necho \"$*\" >" + QFile::encodeName(m_root.filePath(QStringLiteral("/arguments"))) + "\nexec "
                 + QFile::encodeName(CacheDaemonFixture::programPath()) + " \"$@\"\n"));
         QVERIFY(QFile::setPermissions(m_root.filePath(wrapper), QFile::ReadOwner | QFile::ExeOwner));
-        const QVariant reply = call(QStringLiteral("ModifyUserPassword"),
-            { QStringLiteral("@alice"), QStringLiteral("alice-password"), QStringLiteral("new") });
+        const QVariant reply = call(QStringLiteral("ModifyUserPassword"), change);
         QCOMPARE(m_root.readFile(QStringLiteral("/arguments")), QByteArray("--modify-user-passwd -\n"));
         // The domain server checks the old password; the new one must be the one accepted afterwards.
         QCOMPARE(QJsonDocument::fromJson(reply.toString().toUtf8()).object().value(QLatin1String("code")).toInt(-1), 0);
@@ -449,20 +442,13 @@ private:
         return reply.arguments().value(0);
     }
 
-    QVariant userProperty(uint uid, const char *property)
-    {
-        return QDBusInterface(
-            kName, kPath + QStringLiteral("/user") + QString::number(uid), kName + QStringLiteral(".user"), m_conn)
-            .property(property);
-    }
-
     // Sent on the connection of the next call, the signal reaches the service before that call does.
     void announce(const char *session)
     {
-        const QDBusObjectPath path(kLogind + QStringLiteral("/session/") + QLatin1String(session));
-        QVERIFY(m_conn.send(QDBusMessage::createSignal(
-                                kLogind, QStringLiteral("org.freedesktop.login1.Manager"), QStringLiteral("SessionNew"))
-            << QLatin1String(session) << QVariant::fromValue(path)));
+        QDBusMessage signal = QDBusMessage::createSignal(
+            kLogind, QStringLiteral("org.freedesktop.login1.Manager"), QStringLiteral("SessionNew"));
+        signal.setArguments(sessionNew(session));
+        QVERIFY(m_conn.send(signal));
         call(QStringLiteral("GetUserIdList"));
     }
 
