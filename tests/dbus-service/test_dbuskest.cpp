@@ -194,16 +194,17 @@ private Q_SLOTS:
                                             << remaining << status << object << settings;
         };
         const QList<uint> all { 1005, 10001, 10002 };
+        // Once the cache is changed, the sessions of users without a record end.
         const QByteArray sweep("ListSessions\nKillSession c2 all 9\nKillSession c3 all 9\nKillSession c4 all 9");
         for (const bool on : { true, false }) {
             const QByteArray state = on ? "" : "disabled ";
             const QByteArray settings = on ? kOn : kOff;
-            // Once the cache is changed, the sessions of users without a record end.
             row(state + "RemoveCacheFile", { 10002u }, "", true, on ? sweep : "", { 1005, 10001 }, ~0u, true, settings);
             row(state + "RemoveCacheFilesNotInList", { QVariant::fromValue(QList<uint> { 10001 }) }, "", true,
                 on ? sweep : "", { 10001 }, ~0u, true, settings);
             row(state + "RemoveAllCacheFiles", {}, "", true,
-                on ? sweep.left(12) + "\nKillSession c1 all 9" + sweep.mid(12) : "", {}, ~0u, false, settings);
+                on ? QByteArray(sweep).replace("\nKillSession c2", "\nKillSession c1 all 9\nKillSession c2") : "", {},
+                ~0u, false, settings);
             row(state + "DisableTerminal", { 10002u }, "", on, "", all, on ? 1 : 0, true, settings);
             row(state + "GetUserGroups", { QStringLiteral("@alice") }, "",
                 on ? QStringList { QStringLiteral("kest"), QStringLiteral("lp") } : QStringList(), "", all, 0, true,
