@@ -6,7 +6,6 @@
 
 #include <QDateTime>
 #include <QFile>
-#include <QJsonDocument>
 #include <QRegularExpression>
 #include <QTcpServer>
 #include <QTest>
@@ -28,13 +27,12 @@ const QString alice
     = ok(R"({"user":{"gecos":"Alice","home":"/home/alice","name":"%1","password":"x","permissions":)"
          R"(["sudo","lp"],"primary_group":{"id":10000,"name":"kest"},"shell":"/bin/bash","uid":10001}})");
 
+// A call of the client, the request the server is to see ("METHOD PATH BODY") and the reply the call then gives.
 struct Operation {
     const char *name;
-    std::function<QString(HttpHelper &)> call;
-    const char *method;
-    const char *path;
-    const char *body;
+    const char *request;
     QString reply;
+    std::function<QString(HttpHelper &)> call;
 };
 
 // The requests of the client; the look-ups after them are of names that are never sent.
@@ -42,35 +40,35 @@ const int requestCount = 7;
 const QList<Operation> &everyOperation()
 {
     static const QList<Operation> list {
-        { "queryUserByName", [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("@alice")); }, "GET",
-            "/v3/account/", R"({"username":"alice","domain":"kest.test"})", alice.arg(QLatin1String("@alice")) },
-        { "queryUserByUid", [](HttpHelper &h) { return h.queryUserByUid(10001); }, "GET", "/v3/account/",
-            R"({"uid":10001})", alice.arg(QLatin1String("alice")) },
+        { "queryUserByName", R"(GET /v3/account/ {"username":"alice","domain":"kest.test"})",
+            alice.arg(QLatin1String("@alice")),
+            [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("@alice")); } },
+        { "queryUserByUid", R"(GET /v3/account/ {"uid":10001})", alice.arg(QLatin1String("alice")),
+            [](HttpHelper &h) { return h.queryUserByUid(10001); } },
         { "authenticate",
+            R"(POST /v1/auth/ {"data":{"username":"@alice","password":"a\"b\\c","machine_id":"machine-1"},"method":"otp"})",
+            ok(R"({"result":false})"),
             [](HttpHelper &h) {
                 return h.authenticate(QStringLiteral("@alice"), QStringLiteral("a\"b\\c"), QStringLiteral("otp"));
-            },
-            "POST", "/v1/auth/",
-            "{\"data\":{\"username\":\"@alice\",\"password\":\"a\\\"b\\\\c\",\"machine_id\":\"machine-1\"},"
-            "\"method\":\"otp\"}",
-            ok(R"({"result":false})") },
-        { "queryGroupByName", [](HttpHelper &h) { return h.queryGroupByName(QStringLiteral("staff")); }, "GET",
-            "/v3/group/", R"({"groupname":"staff"})",
-            ok(R"({"group":{"gid":10010,"members":["alice"],"name":"staff"}})") },
-        { "queryGroupByGid", [](HttpHelper &h) { return h.queryGroupByGid(10000); }, "GET", "/v3/group/",
-            R"({"gid":10000})", ok(R"({"group":{"gid":10000,"members":["alice","bob"],"name":"kest"}})") },
+            } },
+        { "queryGroupByName", R"(GET /v3/group/ {"groupname":"staff"})",
+            ok(R"({"group":{"gid":10010,"members":["alice"],"name":"staff"}})"),
+            [](HttpHelper &h) { return h.queryGroupByName(QStringLiteral("staff")); } },
+        { "queryGroupByGid", R"(GET /v3/group/ {"gid":10000})",
+            ok(R"({"group":{"gid":10000,"members":["alice","bob"],"name":"kest"}})"),
+            [](HttpHelper &h) { return h.queryGroupByGid(10000); } },
         { "resetPassword",
+            R"(PATCH /v3/client/reset_password {"uid":10001,"username":"@alice","password":"new","old_password":"alice-password"})",
+            ok("null"),
             [](HttpHelper &h) {
                 return h.resetPassword(
                     10001, QStringLiteral("@alice"), QStringLiteral("new"), QStringLiteral("alice-password"));
-            },
-            "PATCH", "/v3/client/reset_password",
-            R"({"uid":10001,"username":"@alice","password":"new","old_password":"alice-password"})", ok("null") },
-        { "queryDomain", [](HttpHelper &h) { return h.queryDomain(); }, "GET", "/v1/domain/", "", domainReply },
-        { "plain name", [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("alice")); }, "GET", "/v3/account/",
-            "", unknownAccount },
-        { "full-width at sign", [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("\uFF20alice")); }, "GET",
-            "/v3/account/", "", unknownAccount },
+            } },
+        { "queryDomain", "GET /v1/domain/ ", domainReply, [](HttpHelper &h) { return h.queryDomain(); } },
+        { "plain name", "GET /v3/account/ ", unknownAccount,
+            [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("alice")); } },
+        { "full-width at sign", "GET /v3/account/ ", unknownAccount,
+            [](HttpHelper &h) { return h.queryUserByName(QStringLiteral("\uFF20alice")); } },
     };
     return list;
 }
@@ -97,11 +95,6 @@ QStringList logged(const QStringList &expected)
     }
     return actual;
 }
-
-QVariantMap set(const char *key, const QVariant &value)
-{
-    return { { QLatin1String(key), value } };
-}
 } // namespace
 
 class HttpHelperTest : public QObject
@@ -124,95 +117,91 @@ private Q_SLOTS:
         SyslogCapture::clear();
     }
 
-    // behaviour: the server's misbehaviour on the operation's path, "server:CERTIFICATE [LISTEN]" for another
-    // face of the server ("plain": HTTP), or "no settings".
+    // settings: lines "group/key=value", or "group/key" to leave the key out. behaviour: the server's
+    // misbehaviour on the operation's path, "server:CERTIFICATE [LISTEN]" for another face of the server
+    // ("plain": HTTP), or "no settings".
     void exchange_data()
     {
         QTest::addColumn<int>("op");
-        QTest::addColumn<QVariantMap>("settings");
+        QTest::addColumn<QString>("settings");
         QTest::addColumn<QString>("behaviour");
         QTest::addColumn<QString>("expected");
         QTest::addColumn<int>("sent");
         QTest::addColumn<QStringList>("warnings");
-        const auto row = [](const QByteArray &name, int op, const QVariantMap &settings, const char *behaviour,
-                             const QString &expected, int sent, const QStringList &warnings) {
-            QTest::newRow(name.constData())
-                << op << settings << QString::fromLatin1(behaviour) << expected << sent << warnings;
+        const auto row = [](const QByteArray &name, int op, const QString &settings, const char *behaviour,
+                             const QString &expected, int sent, const QString &warnings) {
+            QTest::newRow(name.constData()) << op << settings << QString::fromLatin1(behaviour) << expected << sent
+                                            << warnings.split(QLatin1Char('\n'), Qt::SkipEmptyParts);
         };
         for (int i = 0; i < requestCount; ++i) {
             const Operation &op = everyOperation().at(i);
-            const QString dataError = QStringLiteral("http response data error. url: ") + url(op.path);
+            const QString request = QString::fromLatin1(op.request);
+            const QString url = this->url(request.section(QLatin1Char(' '), 1, 1));
+            const QString dataError = QStringLiteral("\nhttp response data error. url: ") + url;
             row(op.name, i, {}, "", op.reply, 1, {});
-            row(op.name + QByteArray(", no msg"), i, {}, "no-msg", refused, 1, { dataError });
+            row(op.name + QByteArray(", no msg"), i, {}, "no-msg", refused, 1, dataError);
             row(op.name + QByteArray(", not JSON"), i, {}, "not-json", refused, 1,
-                { QStringLiteral(
-                      "invalid reply data, parse error: *, raw data: this is not json, http status: 200, url: ")
-                        + url(op.path) + QStringLiteral(", method: ") + QLatin1String(op.method),
-                    dataError });
+                QStringLiteral("invalid reply data, parse error: *, raw data: this is not json, http status: 200, "
+                               "url: %1, method: %2")
+                        .arg(url, request.section(QLatin1Char(' '), 0, 0))
+                    + dataError);
         }
         // What follows a reply that is not one: the error, then the checks of an empty body.
-        const QString notOk = QStringLiteral("http response status is not ok. actual http status code: ");
-        const QStringList abandoned {
-            QStringLiteral("invalid reply data, parse error: *, raw data: , http status: 0, url: *, method: GET"),
-            notOk + QStringLiteral("0"), QStringLiteral("http response data error. url: *")
-        };
+        const QString abandoned = QStringLiteral(
+            "\ninvalid reply data, parse error: *, raw data: , http status: 0, url: *, method: GET"
+            "\nhttp response status is not ok. actual http status code: 0\nhttp response data error. url: *");
         const auto failed = [this](const char *error, const char *detail) {
             return QStringLiteral("error code %1 url: %2, error detail: %3")
-                .arg(QLatin1String(error), url("/v3/account/"), QLatin1String(detail));
+                .arg(QLatin1String(error), url(QStringLiteral("/v3/account/")), QLatin1String(detail));
         };
+        const QString notOk = QStringLiteral("\nhttp response status is not ok. actual http status code: ");
         row("404 with a JSON body", 0, {}, "status:404", alice.arg(QLatin1String("@alice")), 1,
-            { failed("ContentNotFoundError", "*"), notOk + QStringLiteral("404") });
+            failed("ContentNotFoundError", "*") + notOk + QStringLiteral("404"));
         row("closed without an answer: sent once", 0, {}, "close", refused, 1,
-            QStringList { failed("RemoteHostClosedError", "*") } + abandoned);
+            failed("RemoteHostClosedError", "*") + abandoned);
         row("redirect not followed", 0, {}, "redirect:/v1/domain/",
-            QStringLiteral(R"({"code":302,"data":null,"msg":"moved"})"), 1, { notOk + QStringLiteral("302") });
-        row("reply after the time-out", 0, set("main/network-timeout", 1), "delay:2000", refused, 1,
-            QStringList { failed("OperationCanceledError", "Operation canceled") } + abandoned);
+            QStringLiteral(R"({"code":302,"data":null,"msg":"moved"})"), 1, notOk + QStringLiteral("302"));
+        row("reply after the time-out", 0, QStringLiteral("main/network-timeout=1"), "delay:2000", refused, 1,
+            failed("OperationCanceledError", "Operation canceled") + abandoned);
         row("without settings file nothing is sent", 6, {}, "no settings", unreachable, 0,
-            { QStringLiteral("configuration file is broken.") });
+            QStringLiteral("configuration file is broken."));
         row("plain name", 7, {}, "", unknownAccount, 0, {});
         row("full-width at sign", 8, {}, "", unknownAccount, 0, {});
-        row("plain name, server down: not even probed", 7, set("main/port", closedPort()), "", unknownAccount, 0, {});
+        row("plain name, server down: not even probed", 7, QStringLiteral("main/port=%1").arg(closedPort()), "",
+            unknownAccount, 0, {});
 
         const QString missing = m_other.filePath(QStringLiteral("missing.pem"));
-        const auto untrusted = [](const QString &url) {
-            return QStringList { QStringLiteral("ssl error url: ") + url
-                + QStringLiteral(" certificate error: *.     certificate error: *") };
-        };
-        const QString domain = url("/v1/domain/");
-        row("CA file missing, literal address: nothing sent", 6, set("url/server-cert", missing), "", unreachable, 0,
-            { QStringLiteral("server cert file is not exists. config: ") + missing,
-                QStringLiteral("cannot set server key.") });
-        row("server of another CA", 6, set("url/server-cert", m_other.filePath(QStringLiteral("ca.pem"))), "",
-            unreachable, 0, untrusted(domain));
-        row("self-signed server", 6, {}, "server:selfsigned", unreachable, 0, untrusted(domain));
-        row("expired server certificate", 6, {}, "server:expired", unreachable, 0, untrusted(domain));
+        // The url of such a line is the one checked in the rows above.
+        const QString untrusted = QStringLiteral("ssl error url: * certificate error: *.     certificate error: *");
+        row("CA file missing, literal address: nothing sent", 6, QStringLiteral("url/server-cert=") + missing, "",
+            unreachable, 0,
+            QStringLiteral("server cert file is not exists. config: %1\ncannot set server key.").arg(missing));
+        row("server of another CA", 6, QStringLiteral("url/server-cert=") + m_other.filePath(QStringLiteral("ca.pem")),
+            "", unreachable, 0, untrusted);
+        row("self-signed server", 6, {}, "server:selfsigned", unreachable, 0, untrusted);
+        row("expired server certificate", 6, {}, "server:expired", unreachable, 0, untrusted);
         row("no subjectAltName, literal address: taken", 6, {}, "server:nosan", domainReply, 1, {});
-        row("IPv6 literal", 6, set("main/ip", QStringLiteral("::1")), "server:server ::1", domainReply, 1, {});
-        row("host name", 6, set("main/ip", QStringLiteral("localhost")), "server:server 127.0.0.1", domainReply, 1, {});
-        row("host name the certificate lacks", 6, set("main/ip", QStringLiteral("localhost")), "server:nosan 127.0.0.1",
-            unreachable, 0, untrusted(QStringLiteral("https://127.0.0.1:%1/v1/domain/").arg(m_server.port())));
+        row("IPv6 literal", 6, QStringLiteral("main/ip=::1"), "server:server ::1", domainReply, 1, {});
+        row("host name", 6, QStringLiteral("main/ip=localhost"), "server:server 127.0.0.1", domainReply, 1, {});
+        row("host name the certificate lacks", 6, QStringLiteral("main/ip=localhost"), "server:nosan 127.0.0.1",
+            unreachable, 0, untrusted);
         // The server then refuses the handshake.
-        row("neither client certificate nor key", 6,
-            { { QStringLiteral("url/public-key"), QVariant() }, { QStringLiteral("url/private-key"), missing } }, "",
+        row("neither client certificate nor key", 6, QStringLiteral("url/public-key\nurl/private-key=") + missing, "",
             refused, 0,
-            QStringList { QStringLiteral("client public key file is not exists. config: "),
-                QStringLiteral("client private key file is not exists. config: ") + missing,
-                QStringLiteral("cannot set local public key."), QStringLiteral("cannot read local private key."),
-                QStringLiteral("error code * url: * error detail: *") }
+            QStringLiteral("client public key file is not exists. config: \nclient private key file is not exists. "
+                           "config: %1\ncannot set local public key.\ncannot read local private key.\n"
+                           "error code * url: * error detail: *")
+                    .arg(missing)
                 + abandoned);
         // Without any certificate setting, a look at one would log its absence.
-        row("plain HTTP", 0,
-            { { QStringLiteral("url/protocol"), QStringLiteral("http://") },
-                { QStringLiteral("url/server-cert"), QVariant() }, { QStringLiteral("url/public-key"), QVariant() },
-                { QStringLiteral("url/private-key"), QVariant() } },
+        row("plain HTTP", 0, QStringLiteral("url/protocol=http://\nurl/server-cert\nurl/public-key\nurl/private-key"),
             "server:plain", alice.arg(QLatin1String("@alice")), 1, {});
     }
 
     void exchange()
     {
         QFETCH(int, op);
-        QFETCH(QVariantMap, settings);
+        QFETCH(QString, settings);
         QFETCH(QString, behaviour);
         QFETCH(int, sent);
         QFETCH(QStringList, warnings);
@@ -223,7 +212,8 @@ private Q_SLOTS:
         else if (behaviour == QLatin1String("no settings"))
             QVERIFY(m_root.removeSettings());
         else
-            QVERIFY(m_server.setMisbehaviour(QLatin1String(operation.path), behaviour));
+            QVERIFY(m_server.setMisbehaviour(
+                QString::fromLatin1(operation.request).section(QLatin1Char(' '), 1, 1), behaviour));
         HttpHelper helper;
         QTEST(operation.call(helper), "expected");
         const QList<QJsonObject> requests = m_server.requests();
@@ -231,18 +221,18 @@ private Q_SLOTS:
         QCOMPARE(logged(warnings), warnings);
         if (!sent)
             return;
-        QJsonObject request = requests.first();
-        const QJsonObject headers = request.take(QLatin1String("headers")).toObject();
-        request.remove(QLatin1String("connection"));
-        QCOMPARE(request,
-            QJsonObject({ { QStringLiteral("method"), QLatin1String(operation.method) },
-                { QStringLiteral("path"), QLatin1String(operation.path) },
-                { QStringLiteral("body"), QLatin1String(operation.body) },
-                { QStringLiteral("client"),
-                    QLatin1String(m_mode == QLatin1String("plain") ? "" : "kest-test-client") } }));
-        QCOMPARE(headers.value(QLatin1String("content-type")).toString(), QStringLiteral("application/json"));
-        QCOMPARE(headers.value(QLatin1String("user-agent")).toString(), QStringLiteral("KEST"));
-        QCOMPARE(headers.value(QLatin1String("accept")).toString(), QStringLiteral("application/json"));
+        // What the server saw: the request, the name in the client certificate and the headers.
+        const QJsonObject request = requests.first(), headers = request.value(QLatin1String("headers")).toObject();
+        QStringList seen;
+        for (const char *key : { "method", "path", "body", "client" })
+            seen << request.value(QLatin1String(key)).toString();
+        for (const char *key : { "content-type", "accept", "user-agent" })
+            seen << headers.value(QLatin1String(key)).toString();
+        const QString json = QStringLiteral("application/json");
+        QStringList wanted = QString::fromLatin1(operation.request).split(QLatin1Char(' '));
+        wanted << QLatin1String(m_mode == QLatin1String("plain") ? "" : "kest-test-client") << json << json
+               << QStringLiteral("KEST");
+        QCOMPARE(seen, wanted);
     }
 
     // Requests share one connection until the TLS files change. One failed connection starts an outage:
@@ -264,7 +254,7 @@ private Q_SLOTS:
         QVERIFY(ids.value(3) != ids.value(0));
 
         const quint16 closed = closedPort();
-        QVERIFY(writeSettings(set("main/port", closed)) && m_server.clearRequests());
+        QVERIFY(writeSettings(QStringLiteral("main/port=%1").arg(closed)) && m_server.clearRequests());
         for (int i = 0; i < 3; ++i)
             QCOMPARE(helper.queryDomain(), unreachable);
         QCOMPARE(logged({}),
@@ -292,15 +282,19 @@ private:
         return m_server.start(m_server.port(), plain, plain ? QStringLiteral("server") : certificate);
     }
 
-    bool writeSettings(QVariantMap overrides = QVariantMap())
+    // Settings for the server, with the overrides of a row (see exchange_data).
+    bool writeSettings(const QString &overrides = QString())
     {
-        overrides.insert(QStringLiteral("main/domain"), QStringLiteral("kest.test"));
-        return m_root.writeSettings(m_server.settingsIni(overrides));
+        QVariantMap values { { QStringLiteral("main/domain"), QStringLiteral("kest.test") } };
+        for (const QString &line : overrides.split(QLatin1Char('\n'), Qt::SkipEmptyParts))
+            values.insert(line.section(QLatin1Char('='), 0, 0),
+                line.contains(QLatin1Char('=')) ? QVariant(line.section(QLatin1Char('='), 1)) : QVariant());
+        return m_root.writeSettings(m_server.settingsIni(values));
     }
 
-    QString url(const char *path) const
+    QString url(const QString &path) const
     {
-        return QStringLiteral("https://127.0.0.2:") + QString::number(m_server.port()) + QLatin1String(path);
+        return QStringLiteral("https://127.0.0.2:%1").arg(m_server.port()) + path;
     }
 
     TestRoot m_root;
