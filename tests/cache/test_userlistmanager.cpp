@@ -100,7 +100,7 @@ private Q_SLOTS:
     }
 
     // Records marked for removal or of only the version (uid 0, no name) are never listed; of two of one name the
-    // first listed answers. The rebuild keeps alice's digest, disowns the ghost, drops the special name unasked.
+    // first listed answers. The rebuild refreshes alice, keeps her digest, disowns the ghost, skips the special name.
     void loadAndRebuild()
     {
         TestRoot root;
@@ -122,11 +122,11 @@ private Q_SLOTS:
         QCOMPARE(SyslogCapture::matching("abnormal user, remove cache now. user: ").size(), 1);
         QVERIFY(!readCacheRecord(10099) && users.users().size() == 1);
         QCOMPARE(root.readFile(QStringLiteral("/var/lib/libkest-iam/specials.txt")), QByteArray());
+        QCOMPARE(readCacheRecord(10001)->gecos(), QStringLiteral("Alice"));
         QVERIFY(users.checkOfflinePassword(alice, QStringLiteral("secret")));
 
-        // A connection that ends without an answer is a lost server, not a refusal.
         QVERIFY(server.setMisbehaviour(QStringLiteral("/v3/account/"), QStringLiteral("close")));
-        users.rebuildUsers(&http);
+        users.rebuildUsers(&http); // a connection that ends without an answer is a lost server, not a refusal
         QVERIFY(users.hasUserName(alice) && readCacheRecord(10001));
     }
 };
