@@ -9,13 +9,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
     const FuzzRoot &root = FuzzRoot::instance();
     const QString file = QStringLiteral("/var/lib/libkest-iam/10001");
-    if (!root.writeFile(file, data, size))
+    if (!root.writeFile(file, fuzzInput(data, size)))
         return 0;
     CacheControlPtr record = createCacheControl();
-    if (record->readFromFile(root.path(file))) {
-        CacheControlPtr copy = createCacheControl();
-        copy->fromJsonString(record->toJsonString(QJsonDocument::Compact));
-    }
-    createCacheControl()->fromJsonString(QString::fromUtf8(reinterpret_cast<const char *>(data), int(size)));
+    if (record->readFromFile(root.path(file)))
+        createCacheControl()->fromJsonString(record->toJsonString(QJsonDocument::Compact));
+    createCacheControl()->fromJsonString(QString::fromUtf8(fuzzInput(data, size)));
     return 0;
 }

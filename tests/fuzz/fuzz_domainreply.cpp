@@ -15,18 +15,17 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
         return 0;
     // The first byte cuts the rest into the pieces the network would deliver.
     const int piece = data[0] + 1;
-    const QByteArray bytes(reinterpret_cast<const char *>(data) + 1, int(size) - 1);
+    const QByteArray bytes = fuzzInput(data + 1, size - 1);
     HttpReplyReader reader(64 * 1024);
     for (int offset = 0; offset < bytes.size() && reader.state() == HttpReplyReader::State::Incomplete; offset += piece)
         reader.feed(bytes.mid(offset, piece));
     reader.finish();
-    const QString answer
-        = QString::fromUtf8(reader.state() == HttpReplyReader::State::Complete ? reader.body() : bytes);
+    const bool framed = reader.state() == HttpReplyReader::State::Complete;
     QJsonObject user;
-    if (!KestCacheService::validateServerAnswer(answer, QStringLiteral("password"), user))
-        return 0;
-    GroupListManager groups;
-    UserListManager users(&groups);
-    users.addUser(user);
+    if (KestCacheService::validateServerAnswer(
+            QString::fromUtf8(framed ? reader.body() : bytes), QStringLiteral("password"), user)) {
+        GroupListManager groups;
+        UserListManager(&groups).addUser(user);
+    }
     return 0;
 }

@@ -4,8 +4,7 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
-    const FuzzRoot &root = FuzzRoot::instance();
-    if (!root.writeFile(QStringLiteral("/var/lib/libkest-iam/groups.txt"), data, size))
+    if (!FuzzRoot::instance().writeFile(QStringLiteral("/var/lib/libkest-iam/groups.txt"), fuzzInput(data, size)))
         return 0;
     GroupListManager groups;
     groups.groupsOfUser(QStringLiteral("@alice"));

@@ -2,22 +2,17 @@
 #include "fuzzroot.h"
 #include "passwordpolicy.h"
 
-#include <QFile>
 #include <QJsonDocument>
 #include <QSettings>
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
-    const FuzzRoot &root = FuzzRoot::instance();
-    const QJsonDocument document
-        = QJsonDocument::fromJson(QByteArray::fromRawData(reinterpret_cast<const char *>(data), int(size)));
-    const QString path = root.path(QStringLiteral("/etc/kest-iam.conf"));
+    const QString path = FuzzRoot::instance().path(QStringLiteral("/etc/kest-iam.conf"));
     QFile::remove(path);
     {
         QSettings settings(path, QSettings::IniFormat);
-        PasswordPolicy::write(settings, document.object());
+        PasswordPolicy::write(settings, QJsonDocument::fromJson(fuzzInput(data, size)).object());
     }
-    const QSettings settings(path, QSettings::IniFormat);
-    PasswordPolicy::read(settings);
+    PasswordPolicy::read(QSettings(path, QSettings::IniFormat));
     return 0;
 }
