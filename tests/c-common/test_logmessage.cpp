@@ -51,59 +51,51 @@ class LogMessageTest : public QObject
 private Q_SLOTS:
     void init() { SyslogCapture::clear(); }
 
-    void lineLayout_data()
-    {
-        QTest::addColumn<QByteArray>("user");
-        QTest::addColumn<QByteArray>("tail");
-        QTest::newRow("with USER") << QByteArray("alice")
-                                   << "user: alice(" + ids() + "), src/c-common/common, 273, is_connect, 100% %n sure ";
-        QTest::newRow("without USER") << QByteArray()
-                                      << "user: " + ids() + ", src/c-common/common, 273, is_connect, 100% %n sure  ";
-    }
-
-    void lineLayout()
-    {
-        QFETCH(QByteArray, user);
-        QFETCH(QByteArray, tail);
-        setEnv("USER", user);
-        const QByteArrayList streams
-            = streamed([] { log_message(3, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure"); });
-        const QList<SyslogLine> lines = SyslogCapture::lines();
-        QCOMPARE(lines.size(), 1);
-        QCOMPARE(lines.first().priority, 3);
-        const QByteArray line = lines.first().text;
-        QVERIFY2(QRegExp(QStringLiteral("\\d{4}-\\d\\d-\\d\\d \\d\\d:\\d\\d:\\d\\d"))
-                     .exactMatch(QString::fromLatin1(line.left(19))),
-            line);
-        QCOMPARE(line.mid(19), " process: test_logmessage(" + QByteArray::number(getpid()) + "), " + tail);
-        QCOMPARE(streams, QByteArrayList({ line + '\n', QByteArray() }));
-    }
-
-    void levels_data()
+    // One message at each level, with and without USER: the streams it reaches and its whole line.
+    void logged_data()
     {
         QTest::addColumn<int>("level");
-        QTest::addColumn<QByteArray>("logLevel");
+        QTest::addColumn<QByteArray>("logLevel"); // KEST_IAM_LOGLEVEL; null: unset
+        QTest::addColumn<QByteArray>("user"); // null: unset
         QTest::addColumn<QByteArray>("sinks");
-        QTest::newRow("warning") << 4 << QByteArray() << QByteArray("syslog stderr");
-        QTest::newRow("notice") << 5 << QByteArray() << QByteArray("syslog");
-        QTest::newRow("trace, variable unset") << 9 << QByteArray() << QByteArray();
-        QTest::newRow("trace, variable empty") << 8 << QByteArray("") << QByteArray();
-        QTest::newRow("trace, variable 0") << 9 << QByteArray("0") << QByteArray("syslog stdout");
+        const QByteArray alice("alice"), unset;
+        QTest::newRow("error") << 3 << unset << alice << QByteArray("syslog stderr");
+        QTest::newRow("warning, without USER") << 4 << unset << unset << QByteArray("syslog stderr");
+        QTest::newRow("notice") << 5 << unset << alice << QByteArray("syslog");
+        QTest::newRow("trace, variable unset") << 9 << unset << alice << QByteArray();
+        QTest::newRow("trace, variable empty") << 8 << QByteArray("") << alice << QByteArray();
+        QTest::newRow("trace, variable 0") << 9 << QByteArray("0") << unset << QByteArray("syslog stdout");
     }
 
-    void levels()
+    void logged()
     {
         QFETCH(int, level);
         QFETCH(QByteArray, logLevel);
+        QFETCH(QByteArray, user);
         QFETCH(QByteArray, sinks);
+        setEnv("USER", user);
         setEnv("KEST_IAM_LOGLEVEL", logLevel);
-        const QByteArrayList streams = streamed([level] { log_message(level, "file", 1, "function", "level test"); });
+        // A body that printf would take for conversions once it were used as a format.
+        const QByteArrayList streams = streamed(
+            [level] { log_message(level, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure"); });
         qunsetenv("KEST_IAM_LOGLEVEL");
-        QCOMPARE(streams.first().contains("level test"), sinks.contains("stderr"));
-        QCOMPARE(streams.last().contains("level test"), sinks.contains("stdout"));
-        QCOMPARE(SyslogCapture::count("level test"), sinks.contains("syslog") ? 1 : 0);
-        if (sinks.contains("syslog"))
-            QCOMPARE(SyslogCapture::lines().first().priority, level);
+        const QList<SyslogLine> lines = SyslogCapture::lines();
+        QCOMPARE(lines.size(), sinks.contains("syslog") ? 1 : 0);
+        const QByteArray line = lines.isEmpty() ? QByteArray() : lines.first().text;
+        QCOMPARE(streams,
+            QByteArrayList(
+                { sinks.contains("stderr") ? line + '\n' : "", sinks.contains("stdout") ? line + '\n' : "" }));
+        if (lines.isEmpty())
+            return;
+        QCOMPARE(lines.first().priority, level);
+        QVERIFY2(QRegExp(QStringLiteral("\\d{4}-\\d\\d-\\d\\d \\d\\d:\\d\\d:\\d\\d"))
+                     .exactMatch(QString::fromLatin1(line.left(19))),
+            line);
+        // Without USER the ids stand alone, and the line ends in two spaces.
+        const QByteArray who = user.isNull() ? ids() + ", " : user + '(' + ids() + "), ";
+        QCOMPARE(line.mid(19),
+            " process: test_logmessage(" + QByteArray::number(getpid()) + "), user: " + who
+                + "src/c-common/common, 273, is_connect, 100% %n sure " + (user.isNull() ? " " : ""));
     }
 
     void nullArgumentsAndLimits()

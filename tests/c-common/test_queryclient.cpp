@@ -3,6 +3,8 @@
 #include "syslogcapture.h"
 #include "testroot.h"
 
+#include <QFile>
+#include <QProcess>
 #include <QTest>
 
 class QueryClientTest : public QObject
@@ -12,26 +14,48 @@ class QueryClientTest : public QObject
 private Q_SLOTS:
     void init() { SyslogCapture::clear(); }
 
-    void readPort_data()
+    // What each reader of the pid file makes of it: "exists pid running port daemonPort", "-" where one fails.
+    void pidFile_data()
     {
+        QTest::addColumn<QString>("process"); // a sleeper's name; its pid stands for PID
         QTest::addColumn<QByteArray>("content");
-        QTest::addColumn<int>("port"); // -1: no port
-        QTest::newRow("pid and port") << QByteArray("4711\r\n10080\r\n\n") << 10080;
-        QTest::newRow("pid only") << QByteArray("4711\n7") << 4711;
-        QTest::newRow("not digits") << QByteArray("4711\n80a\n") << -1;
-        QTest::newRow("wraps at 65536") << QByteArray("4711\n70000\n") << 4464;
-        QTest::newRow("empty") << QByteArray("") << -1;
+        QTest::addColumn<QByteArray>("expected");
+        QTest::newRow("cache-kest, port wraps")
+            << QStringLiteral("cache-kest") << QByteArray("PID\n70000\n") << QByteArray("1 PID 1 4464 4464");
+        QTest::newRow("pid now used by another program")
+            << QStringLiteral("cache-kest-old") << QByteArray("PID\n10080\n") << QByteArray("1 PID 0 10080 -");
+        QTest::newRow("no such process, CRLF, blank last line")
+            << QString() << QByteArray("999999999\r\n10080\r\n\n") << QByteArray("1 999999999 0 10080 -");
+        QTest::newRow("port not digits") << QString() << QByteArray("999999999\n80a\n")
+                                         << QByteArray("1 999999999 0 - -");
+        QTest::newRow("blank first line") << QString() << QByteArray("\n10080\n") << QByteArray("1 - 0 10080 -");
+        QTest::newRow("empty") << QString() << QByteArray("") << QByteArray("0 - 0 - -");
     }
 
-    void readPort()
+    void pidFile()
     {
+        QFETCH(QString, process);
         QFETCH(QByteArray, content);
-        QFETCH(int, port);
+        QFETCH(QByteArray, expected);
         TestRoot root;
-        QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"), content));
-        unsigned short read = 0;
-        QCOMPARE(read_port(&read), port < 0 ? 0 : 1);
-        QCOMPARE(int(read), qMax(port, 0));
+        QProcess sleeper;
+        if (!process.isEmpty()) {
+            // Through a link: the sleeper's first argument is a longer path that ends in that name.
+            QVERIFY(QFile::link(QStringLiteral("/bin/sleep"), root.filePath(QLatin1Char('/') + process)));
+            sleeper.start(root.filePath(QLatin1Char('/') + process), { QStringLiteral("30") });
+            QVERIFY(sleeper.waitForStarted());
+        }
+        const QByteArray pid = QByteArray::number(sleeper.processId());
+        QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"), content.replace("PID", pid)));
+        char pidText[64];
+        unsigned short port = 0, daemonPort = 0;
+        const bool pidRead = read_pid_file(pidText), portRead = read_port(&port);
+        const QByteArrayList seen { QByteArray::number(pid_file_exists()), pidRead ? QByteArray(pidText) : "-",
+            QByteArray::number(is_cache_daemon_running()), portRead ? QByteArray::number(port) : "-",
+            cache_daemon_port(&daemonPort) ? QByteArray::number(daemonPort) : "-" };
+        QCOMPARE(seen.join(' '), expected.replace("PID", pid));
+        sleeper.kill();
+        sleeper.waitForFinished();
     }
 
     void query_data()
