@@ -12,19 +12,18 @@ namespace
 // Runs what with stderr and stdout sent to files; returns what each of the two received.
 QByteArrayList streamed(const std::function<void()> &what)
 {
-    FILE *const streams[] = { stderr, stdout };
     QTemporaryFile files[2];
     int saved[2];
     for (int i = 0; i < 2; ++i) {
         files[i].open();
-        saved[i] = dup(fileno(streams[i]));
-        dup2(files[i].handle(), fileno(streams[i]));
+        saved[i] = dup(2 - i);
+        dup2(files[i].handle(), 2 - i);
     }
     what();
+    fflush(nullptr);
     QByteArrayList texts;
     for (int i = 0; i < 2; ++i) {
-        fflush(streams[i]);
-        dup2(saved[i], fileno(streams[i]));
+        dup2(saved[i], 2 - i);
         close(saved[i]);
         files[i].seek(0);
         texts << files[i].readAll();
@@ -35,12 +34,6 @@ QByteArrayList streamed(const std::function<void()> &what)
 void setEnv(const char *name, const QByteArray &value)
 {
     value.isNull() ? qunsetenv(name) : qputenv(name, value);
-}
-
-QByteArray ids()
-{
-    return QByteArray::number(getuid()) + ',' + QByteArray::number(geteuid()) + ", " + QByteArray::number(getgid())
-        + ',' + QByteArray::number(getegid());
 }
 } // namespace
 
@@ -78,7 +71,6 @@ private Q_SLOTS:
         // A body that printf would take for conversions once it were used as a format.
         const QByteArrayList streams = streamed(
             [level] { log_message(level, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure"); });
-        qunsetenv("KEST_IAM_LOGLEVEL");
         const QList<SyslogLine> lines = SyslogCapture::lines();
         QCOMPARE(lines.size(), sinks.contains("syslog") ? 1 : 0);
         const QByteArray line = lines.isEmpty() ? QByteArray() : lines.first().text;
@@ -92,9 +84,10 @@ private Q_SLOTS:
                      .exactMatch(QString::fromLatin1(line.left(19))),
             line);
         // Without USER the ids stand alone, and the line ends in two spaces.
-        const QByteArray who = user.isNull() ? ids() + ", " : user + '(' + ids() + "), ";
+        const QByteArray ids = QString::asprintf("%u,%u, %u,%u", getuid(), geteuid(), getgid(), getegid()).toLatin1();
         QCOMPARE(line.mid(19),
-            " process: test_logmessage(" + QByteArray::number(getpid()) + "), user: " + who
+            " process: test_logmessage(" + QByteArray::number(getpid())
+                + "), user: " + (user.isNull() ? ids + ", " : user + '(' + ids + "), ")
                 + "src/c-common/common, 273, is_connect, 100% %n sure " + (user.isNull() ? " " : ""));
     }
 
