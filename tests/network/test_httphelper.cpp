@@ -69,13 +69,6 @@ const QList<Operation> &everyOperation()
     return list;
 }
 
-// A port of the server's address on which nothing listens.
-quint16 closedPort()
-{
-    QTcpServer probe;
-    return probe.listen(QHostAddress(DomainServerFixture::address())) ? probe.serverPort() : 0;
-}
-
 // The warnings logged so far, one a line, after "cpu time: N, ".
 QString logged()
 {
@@ -203,18 +196,17 @@ private Q_SLOTS:
         QVERIFY2(matches(logged(), warnings), qPrintable(logged()));
         if (!sent)
             return;
-        // What the server saw: the request, the name in the client certificate and the headers.
-        const QJsonObject request = requests.first(), headers = request.value(QLatin1String("headers")).toObject();
-        QStringList seen;
+        // What the server saw: the request, the client's name in its certificate and the headers.
+        const QJsonObject headers = requests.first().value(QLatin1String("headers")).toObject();
+        QString seen;
         for (const char *key : { "method", "path", "body", "client" })
-            seen << request.value(QLatin1String(key)).toString();
+            seen += requests.first().value(QLatin1String(key)).toString() + QLatin1Char(' ');
         for (const char *key : { "content-type", "accept", "user-agent" })
-            seen << headers.value(QLatin1String(key)).toString();
-        const QString json = QStringLiteral("application/json");
-        QStringList wanted = QString::fromLatin1(operation.request).split(QLatin1Char(' '));
-        wanted << QLatin1String(m_mode == QLatin1String("plain") ? "" : "kest-test-client") << json << json
-               << QStringLiteral("KEST");
-        QCOMPARE(seen, wanted);
+            seen += headers.value(QLatin1String(key)).toString() + QLatin1Char(' ');
+        QCOMPARE(seen,
+            QLatin1String(operation.request)
+                + QLatin1String(m_mode == QLatin1String("plain") ? "  " : " kest-test-client ")
+                + QLatin1String("application/json application/json KEST "));
     }
 
     // Requests share one connection until the TLS files change. One failed connection starts an outage:
@@ -235,7 +227,10 @@ private Q_SLOTS:
         QCOMPARE(ids, (QList<int> { ids.value(0), ids.value(0), ids.value(0), ids.value(3) }));
         QVERIFY(ids.value(3) != ids.value(0));
 
-        const quint16 closed = closedPort();
+        QTcpServer probe; // a port of the server's address on which nothing listens
+        QVERIFY(probe.listen(QHostAddress(DomainServerFixture::address())));
+        const quint16 closed = probe.serverPort();
+        probe.close();
         QVERIFY(writeSettings(QStringLiteral("main/port=%1").arg(closed)) && m_server.clearRequests());
         for (int i = 0; i < 3; ++i)
             QCOMPARE(helper.queryDomain(), unreachable);
