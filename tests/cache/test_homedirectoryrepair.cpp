@@ -46,24 +46,27 @@ private Q_SLOTS:
     void repair_data()
     {
         QTest::addColumn<QString>("user");
-        QTest::addColumn<QStringList>("entries"); // a trailing "/" makes a directory
+        // A trailing "/" makes a directory, "@" a link out of the home, "*" a file listed before the directory.
+        QTest::addColumn<QStringList>("entries");
         QTest::addColumn<uint>("owner"); // the home's owner before
         QTest::addColumn<QByteArray>("logged");
-        QTest::newRow("no home") << QStringLiteral("@alice") << QStringList() << 0u
-                                 << QByteArray("user home directory is not exists.");
-        QTest::newRow("unknown user") << QStringLiteral("@bob") << QStringList { QStringLiteral("f") } << 0u
-                                      << QByteArray("cannot find user id: @bob");
-        QTest::newRow("already owned") << QStringLiteral("@alice") << QStringList { QStringLiteral("f") } << 10001u
-                                       << QByteArray(" owner @alice is already right.");
-        QTest::newRow("files, hidden ones not counted")
-            << QStringLiteral("@alice")
-            << QStringList { QStringLiteral("a"), QStringLiteral("b"), QStringLiteral(".profile"),
-                   QStringLiteral(".cache/") }
-            << 0u << QByteArray("changed user:  @alice  home  0  directories and  2  files");
-        QTest::newRow("subdirectories end the walk")
-            << QStringLiteral("@alice")
-            << QStringList { QStringLiteral("a"), QStringLiteral("docs/"), QStringLiteral("music/") } << 0u
-            << QByteArray("changed user:  @alice  home  2  directories and  1  files");
+        QTest::addColumn<uint>("mode"); // the home's after a change, when the order of its entries settles it
+        const auto row
+            = [](const char *name, const char *user, const char *entries, uint owner, const char *logged, uint mode) {
+                  QTest::newRow(name) << QString::fromLatin1(user)
+                                      << QString::fromLatin1(entries).split(QLatin1Char(' '), Qt::SkipEmptyParts)
+                                      << owner << QByteArray(logged) << mode;
+              };
+        row("no home", "@alice", "", 0, "user home directory is not exists.", 0);
+        row("unknown user", "@bob", "f", 0, "cannot find user id: @bob", 0);
+        row("already owned", "@alice", "f", 10001, " owner @alice is already right.", 0);
+        row("files, hidden ones not counted", "@alice", "a b .profile .cache/", 0,
+            "changed user:  @alice  home  0  directories and  2  files", 0x640);
+        row("subdirectories and links end the walk", "@alice", "a docs/ music/ out@", 0,
+            "changed user:  @alice  home  3  directories and  1  files", 0);
+        // Entries come in the file system's own order, not sorted: a directory listed last leaves its mode.
+        row("directory listed last", "@alice", "docs/ *", 0,
+            "changed user:  @alice  home  1  directories and  1  files", 0x750);
     }
 
     void repair()
@@ -72,16 +75,30 @@ private Q_SLOTS:
         QFETCH(QStringList, entries);
         QFETCH(uint, owner);
         QFETCH(QByteArray, logged);
+        QFETCH(uint, mode);
         TestRoot root;
         GroupListManager groups;
         UserListManager users(&groups);
         users.addUser(
             QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") }, { QStringLiteral("uid"), 10001 } });
         const QString home = root.filePath(QStringLiteral("/home/") + user);
-        for (const QString &entry : qAsConst(entries))
-            QVERIFY(entry.endsWith(QLatin1Char('/'))
-                    ? QDir().mkpath(home + QLatin1Char('/') + entry + QStringLiteral("inner"))
-                    : root.writeFile(QStringLiteral("/home/") + user + QLatin1Char('/') + entry, "x"));
+        const QString outside = root.filePath(QStringLiteral("/srv"));
+        for (const QString &entry : qAsConst(entries)) {
+            const QString path = home + QLatin1Char('/') + entry;
+            QVERIFY(QDir().mkpath(home) && QDir().mkpath(outside));
+            QVERIFY(entry.endsWith(QLatin1Char('/')) ? QDir().mkpath(path + QStringLiteral("inner"))
+                    : entry.endsWith(QLatin1Char('@'))
+                    ? QFile::link(outside, path)
+                    : entry == QLatin1String("*") || QFile(path).open(QIODevice::WriteOnly));
+        }
+        // The one file "*" stands for takes names until the file system lists it before the directory.
+        for (int i = 0;
+             entries.contains(QStringLiteral("*")) && (i == 0 || listed(home).constLast() != QLatin1String("docs"));
+             ++i) {
+            QVERIFY2(i < 50, "no file name the file system lists first");
+            QFile::remove(home + QStringLiteral("/z%1.txt").arg(i - 1));
+            QVERIFY(QFile(home + QStringLiteral("/z%1.txt").arg(i)).open(QIODevice::WriteOnly));
+        }
         QVERIFY(entries.isEmpty() || chown(QFile::encodeName(home).constData(), owner, 0) == 0);
         const mode_t before = statOf(home).st_mode;
         SyslogCapture::clear();
@@ -92,32 +109,11 @@ private Q_SLOTS:
         const bool changed = logged.startsWith("changed");
         QCOMPARE(statOf(home).st_uid, changed ? uid_t(10001) : uid_t(owner));
         QCOMPARE(statOf(home).st_gid, changed ? gid_t(10000) : gid_t(0));
-        if (!changed)
-            QCOMPARE(statOf(home).st_mode, before);
-        else if (logged.contains("  0  directories"))
-            QCOMPARE(statOf(home).st_mode & 07777, mode_t(0x640));
-        // The walk changes the directories that hold entries, never the entries themselves.
-        for (const QString &entry : qAsConst(entries))
-            QCOMPARE(statOf(home + QLatin1Char('/') + entry).st_uid, uid_t(0));
-    }
-
-    // Entries come in the file system's own order, not sorted: a directory listed last leaves its mode.
-    void walkKeepsTheListingOrder()
-    {
-        TestRoot root;
-        GroupListManager groups;
-        UserListManager users(&groups);
-        users.addUser(
-            QJsonObject { { QStringLiteral("name"), QStringLiteral("@alice") }, { QStringLiteral("uid"), 10001 } });
-        const QString home = root.filePath(QStringLiteral("/home/@alice"));
-        QVERIFY(QDir().mkpath(home + QStringLiteral("/docs")));
-        for (int i = 0; listed(home).size() < 2 || listed(home).constLast() != QLatin1String("docs"); ++i) {
-            QVERIFY2(i < 50, "no file name the file system lists before docs");
-            QFile::remove(home + QStringLiteral("/z%1.txt").arg(i - 1));
-            QVERIFY(root.writeFile(QStringLiteral("/home/@alice/z%1.txt").arg(i), "x"));
-        }
-        HomeDirectoryRepair::repair(QStringLiteral("@alice"), users);
-        QCOMPARE(statOf(home).st_mode & 07777, mode_t(0x750));
+        if (!changed || mode)
+            QCOMPARE(statOf(home).st_mode & (mode ? 07777 : ~0u), mode ? mode : before);
+        // The walk changes the directories that hold entries, never the entries themselves nor what links point to.
+        for (const QString &name : listed(home))
+            QCOMPARE(statOf(home + QLatin1Char('/') + name).st_uid, uid_t(0));
     }
 };
 

@@ -12,11 +12,8 @@ cleanup() {
 }
 trap cleanup EXIT
 
-passed=0
 failed=0
-check() {
-    if "${@:2}"; then passed=$((passed + 1)) && echo "PASS: $1"; else failed=$((failed + 1)) && echo "FAIL: $1"; fi
-}
+check() { if "${@:2}"; then echo "PASS: $1"; else failed=$((failed + 1)) && echo "FAIL: $1"; fi; }
 
 # dpkg-buildpackage writes into the tree and its parent: build from a copy.
 mkdir "$work/src"
@@ -49,25 +46,20 @@ declare -A depends=(
     [libpam-kest]="kest-iam (= $version);libpam0g;libpam-runtime;!libqt5"
 )
 
-# Files, links and empty directories: every entry that is not the directory of another one.
-leaves() {
-    dpkg-deb -c "$1" | awk '{print $6}' | sed -e 's|^\./|/|' -e 's|/$||' | grep -v '^$' | sort \
-        | awk '{ entry[NR] = $0 } END { for (i = 1; i <= NR; i++) { leaf = 1
-              for (j = 1; j <= NR; j++) if (index(entry[j], entry[i] "/") == 1) leaf = 0
-              if (leaf) print entry[i] } }'
-}
+# Files, links and empty directories: every entry that is not the directory of another one. Sorted
+# bytewise, a directory ("/a/") comes right before its contents: a leaf when the next entry is not inside.
 same_files() {
-    diff <(printf '%s\n' $2 "/usr/share/doc/$1/changelog.gz" "/usr/share/doc/$1/copyright" | sort) <(leaves "$3")
+    diff <(printf '%s\n' $2 "/usr/share/doc/$1/changelog.gz" "/usr/share/doc/$1/copyright" | LC_ALL=C sort) \
+        <(dpkg-deb -c "$3" | awk '{ print substr($6, 2) }' | LC_ALL=C sort \
+            | awk 'NR > 1 && (last !~ /\/$/ || index($0, last) != 1) { print last } { last = $0 } END { print last }' \
+            | sed 's|/$||' | LC_ALL=C sort)
 }
 depends_match() {
     local field pattern
     field=$(dpkg-deb -f "$1" Depends)
     for pattern in "${@:2}"; do
-        if [[ $pattern == !* ]]; then
-            ! grep -q -- "${pattern#!}" <<<"$field" || { echo "Depends: $field"; return 1; }
-        else
-            grep -q -- "$pattern" <<<"$field" || { echo "Depends: $field"; return 1; }
-        fi
+        if grep -q -- "${pattern#!}" <<<"$field"; then [[ $pattern != !* ]]; else [[ $pattern == !* ]]; fi \
+            || { echo "Depends: $field"; return 1; }
     done
 }
 debs=()
@@ -89,25 +81,17 @@ dpkg-deb -e "$work/kest-iam_${version}_$arch.deb" "$work/control"
 check "settings file is the only conffile" test "$(cat "$work/control/conffiles")" = /etc/kest-iam.conf
 # Enabled for the next boot; started only by the administrator.
 units_enabled_not_started() {
-    grep -q "deb-systemd-helper enable 'cache-kest.service'" "$work/control/postinst" \
-        && grep -q "deb-systemd-helper enable 'dbus-kest.service'" "$work/control/postinst" \
-        && ! grep -q "deb-systemd-invoke start" "$work/control/postinst"
+    grep -q "helper enable 'cache-kest.service'" "$1" && grep -q "helper enable 'dbus-kest.service'" "$1" \
+        && ! grep -q "deb-systemd-invoke start" "$1"
 }
-check "units enabled on installation, not started" units_enabled_not_started
-if command -v systemd-analyze >/dev/null; then
-    # Point the units at the unpacked programs so that systemd can check them here.
-    mkdir -p "$work/units"
-    for unit in cache-kest dbus-kest; do
-        sed "s|^ExecStart=|ExecStart=$work/root|" "$work/root/lib/systemd/system/$unit.service" \
-            >"$work/units/$unit.service"
-    done
-    # The manual pages named by Documentation= are looked up among the unpacked ones.
-    verify_units() {
-        MANPATH="$work/root/usr/share/man" systemd-analyze verify "$work"/units/*.service >"$work/verify.log" 2>&1 \
-            && ! grep -q . "$work/verify.log" || { cat "$work/verify.log"; return 1; }
-    }
-    check "systemd accepts the units" verify_units
-else
+check "units enabled on installation, not started" units_enabled_not_started "$work/control/postinst"
+# The units, pointed at the unpacked programs, with the manual pages of Documentation= among the unpacked ones.
+verify_units() {
+    sed -i "s|^ExecStart=|ExecStart=$work/root|" "$work"/root/lib/systemd/system/*.service
+    MANPATH="$work/root/usr/share/man" systemd-analyze verify "$work"/root/lib/systemd/system/*.service \
+        >"$work/verify.log" 2>&1 && ! grep -q . "$work/verify.log" || { cat "$work/verify.log"; return 1; }
+}
+if command -v systemd-analyze >/dev/null; then check "systemd accepts the units" verify_units; else
     echo "SKIP: systemd-analyze is not installed"
 fi
 
@@ -122,19 +106,14 @@ policy_loads() {
 }
 check "dbus-daemon loads the policy file" policy_loads
 
-for package in libnss-kest libpam-kest; do
-    dpkg-deb -x "$work/${package}_${version}_$arch.deb" "$work/root"
-done
+dpkg-deb -x "$work/libnss-kest_${version}_$arch.deb" "$work/root"
 edit="$work/root/usr/lib/libnss-kest/kest-nsswitch"
-# nss_edits NAME: installs (twice: a reinstall) and removes with the shipped script on a copy of
-# sample NAME; after each step the copy must equal $NAME.added, then $NAME.removed.
+# nss_edits SAMPLE ADDED REMOVED: installs (twice: a reinstall), then removes with the shipped script on a
+# copy of SAMPLE, which must read as ADDED after each install and as REMOVED at the end.
 nss_edits() {
-    local sample="$work/nsswitch/$1"
-    cp "$sample" "$sample.copy"
-    "$edit" add "$sample.copy" && cmp "$sample.added" "$sample.copy" \
-        && "$edit" add "$sample.copy" && cmp "$sample.added" "$sample.copy" \
-        && "$edit" remove "$sample.copy" && cmp "$sample.removed" "$sample.copy" \
-        || { diff "$sample" "$sample.copy"; return 1; }
+    cp "$1" "$1.copy"
+    "$edit" add "$1.copy" && cmp "$2" "$1.copy" && "$edit" add "$1.copy" && cmp "$2" "$1.copy" \
+        && "$edit" remove "$1.copy" && cmp "$3" "$1.copy" || { diff "$1" "$1.copy"; return 1; }
 }
 mkdir "$work/nsswitch"
 cd "$work/nsswitch"
@@ -142,18 +121,15 @@ printf '%s\n' '# /etc/nsswitch.conf' '#' '# Example configuration of GNU Name Se
     'passwd:         files systemd' 'group:          files systemd' 'shadow:         files systemd' '' \
     'hosts:          files dns' >default
 sed -e 's/^\(passwd\|group\)\(.*\)$/\1\2 kest/' default >default.added
-cp default default.removed
 printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap\t# directory after the local files' \
     'group:  files [NOTFOUND=continue] sss kestrel' 'shadow: files ldap' 'initgroups: files' >others
 printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap kest\t# directory after the local files' \
     'group:  files [NOTFOUND=continue] sss kestrel kest' 'shadow: files ldap' 'initgroups: files' >others.added
-cp others others.removed
 printf '%s\n' 'passwd: files kest systemd # listed by hand' 'group:kest files' 'shadow: files kest' >listed
-cp listed listed.added
 printf '%s\n' 'passwd: files systemd # listed by hand' 'group: files' 'shadow: files kest' >listed.removed
-for sample in default others listed; do
-    check "nsswitch.conf sample $sample: install, reinstall and remove" nss_edits "$sample"
+for sample in "default default.added default" "others others.added others" "listed listed listed.removed"; do
+    check "nsswitch.conf sample ${sample%% *}: install, reinstall and remove" nss_edits $sample
 done
 
-echo "$passed passed, $failed failed"
+echo "$failed failed"
 [ "$failed" -eq 0 ]
