@@ -170,6 +170,15 @@ private Q_SLOTS:
                 QStringLiteral("org.freedesktop.DBus.Introspectable"), QStringLiteral("Introspect"));
             QCOMPARE(block.match(m_conn.call(introspect).arguments().value(0).toString()).captured(), recorded);
         }
+        // A record marked for removal has no list entry: its object reads zeros and empty texts.
+        const QDBusMessage getAll = QDBusMessage::createMethodCall(kName, kPath + QStringLiteral("/user10003"),
+                                        QStringLiteral("org.freedesktop.DBus.Properties"), QStringLiteral("GetAll"))
+            << kName + QStringLiteral(".user");
+        const QVariantMap values = qdbus_cast<QVariantMap>(m_conn.call(getAll).arguments().value(0));
+        QCOMPARE(values.size(), 7);
+        for (const QVariant &value : values)
+            QVERIFY2(
+                value.toString().isEmpty() || value.toString() == QLatin1String("0"), qPrintable(value.toString()));
     }
 
     // The service object in this process, so that its cache and objects can be looked at. A row's name starts with
