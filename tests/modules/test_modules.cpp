@@ -94,13 +94,12 @@ private Q_SLOTS:
                                   R"("name":"@alice","shell":"/bin/bash","uid":10001}})";
         const auto frame = &CacheDaemonFixture::frame;
         const QByteArray entry = frame(aliceEntry), no = frame(R"({"pass":false})"), yes = frame(R"({"pass":true})");
-        const QList<QByteArray> cached { entry }, none;
+        const QList<QByteArray> none;
         const QByteArray alice = "1 0 @alice:x:10001:10000:Alice:/home/alice:/bin/bash";
-        row("local name: no connection", "getpwnam root", cached, "0 2", "");
-        row("local uid: no connection", "getpwuid 9999", cached, "0 2", "");
+        row("local name: no connection", "getpwnam root", { entry }, "0 2", "");
+        row("local uid: no connection", "getpwuid 9999", { entry }, "0 2", "");
         row("no daemon", "getpwnam @alice", none, "-1 2", "");
-        row("cached", "getpwnam @alice", cached, alice, "getAccountByName");
-        row("buffer too small", "getpwnam @alice 30", cached, "-2 34", "getAccountByName");
+        row("buffer too small", "getpwnam @alice 30", { entry }, "-2 34", "getAccountByName");
         row("fetched first", "getpwuid 10001", { no, yes, entry }, alice, "getAccountByUid queryUid getAccountByUid");
         row("unknown", "getpwnam @carol", { no, no }, "0 2", "getAccountByName queryAccountName");
         row("entry of the wrong form", "getpwnam @alice",
