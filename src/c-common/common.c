@@ -169,25 +169,38 @@ int pid_file_exists(void)
     return info.st_size > 0 ? 1 : 0;
 }
 
-int read_pid_file(char *out)
+/* The pid file read once: its first line (the pid) and its last line of two or more characters (the
+ * port), each without line ends; either may come back empty. 0 when the file cannot be read. */
+static int read_pid_lines(char *pid, char *port)
 {
-    if (!pid_file_exists())
-        return 0;
     char path[PATH_MAX_TEXT];
     if (!cache_pid_path(path, sizeof(path)))
         return 0;
     FILE *file = fopen(path, "re");
     if (file == NULL)
         return 0;
-    memset(out, 0, PID_TEXT_SIZE);
-    char *read = fgets(out, PID_TEXT_SIZE - 1, file);
+    memset(pid, 0, PID_TEXT_SIZE);
+    memset(port, 0, PID_TEXT_SIZE);
+    char line[PID_TEXT_SIZE];
+    for (int first = 1; fgets(line, PID_TEXT_SIZE, file) != NULL; first = 0) {
+        if (first)
+            memcpy(pid, line, PID_TEXT_SIZE);
+        if (strlen(line) >= 2)
+            memcpy(port, line, PID_TEXT_SIZE);
+    }
     fclose(file);
-    if (read == NULL || out[0] == '\0')
-        return 0;
-    size_t length = strlen(out);
-    while (length > 0 && (out[length - 1] == '\n' || out[length - 1] == '\r'))
-        out[--length] = '\0';
-    return length > 0 ? 1 : 0;
+    for (char *text = pid; text != NULL; text = text == pid ? port : NULL) {
+        size_t length = strlen(text);
+        while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
+            text[--length] = '\0';
+    }
+    return 1;
+}
+
+int read_pid_file(char *out)
+{
+    char port[PID_TEXT_SIZE];
+    return pid_file_exists() && read_pid_lines(out, port) && out[0] != '\0';
 }
 
 /* 1 when /proc/<pid>/cmdline names the cache daemon. */
@@ -224,11 +237,9 @@ int is_cache_daemon_running(void)
     return is_cache_daemon_pid(pid);
 }
 
-static int parse_port(char *text, unsigned short *port)
+static int parse_port(const char *text, unsigned short *port)
 {
     size_t length = strlen(text);
-    while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
-        text[--length] = '\0';
     if (length == 0)
         return 0;
     for (size_t i = 0; i < length; ++i) {
@@ -241,23 +252,10 @@ static int parse_port(char *text, unsigned short *port)
 
 int cache_daemon_port(unsigned short *port)
 {
-    char path[PATH_MAX_TEXT];
-    if (port == NULL || !cache_pid_path(path, sizeof(path)))
-        return 0;
-    int fd = open(path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0)
-        return 0;
-    char text[2 * PID_TEXT_SIZE];
-    ssize_t got = read(fd, text, sizeof(text) - 1);
-    close(fd);
-    if (got <= 0)
-        return 0;
-    text[got] = '\0';
-    char *newline = strchr(text, '\n');
-    if (newline == NULL || newline == text)
-        return 0;
-    *newline = '\0';
-    return is_cache_daemon_pid(text) && parse_port(newline + 1, port);
+    char pid[PID_TEXT_SIZE];
+    char text[PID_TEXT_SIZE];
+    return port != NULL && read_pid_lines(pid, text) && pid[0] != '\0' && is_cache_daemon_pid(pid)
+        && parse_port(text, port);
 }
 
 int is_connect(int socket)
@@ -320,8 +318,13 @@ static int send_query(const char *function, unsigned short port, const void *req
     }
 
     set_timeout(fd, SO_SNDTIMEO);
-    if (send(fd, request, request_length, MSG_NOSIGNAL) < 0)
-        return fail_connection(function, fd, 313, "send message failed, code: %d, detail: %s");
+    /* A send cut short by the time-out would leave the daemon waiting on half a frame. */
+    for (size_t sent = 0; sent < request_length;) {
+        ssize_t now = send(fd, (const char *)request + sent, request_length - sent, MSG_NOSIGNAL);
+        if (now < 0 && errno != EINTR)
+            return fail_connection(function, fd, 313, "send message failed, code: %d, detail: %s");
+        sent += now > 0 ? (size_t)now : 0;
+    }
     set_timeout(fd, SO_RCVTIMEO);
     return fd;
 }
@@ -388,14 +391,7 @@ static int receive_all(int fd, unsigned char *buffer, size_t length, const struc
     return 1;
 }
 
-int socket_query_frame(
-    const void *request, size_t request_length, char **reply, size_t *reply_length, size_t max_length)
-{
-    return socket_query_frame_to(0, request, request_length, reply, reply_length, max_length);
-}
-
-int socket_query_frame_to(unsigned short port, const void *request, size_t request_length, char **reply,
-    size_t *reply_length, size_t max_length)
+int socket_query_frame(unsigned short port, const void *request, size_t request_length, char **reply, size_t max_length)
 {
     static const char function[] = "socket_query_frame";
     static const char failed[] = "receive message failed, code: %d, detail: %s";
@@ -430,27 +426,12 @@ int socket_query_frame_to(unsigned short port, const void *request, size_t reque
     body[length] = '\0';
     close(fd);
     *reply = body;
-    if (reply_length != NULL)
-        *reply_length = length;
     return 1;
 }
 
 int read_port(unsigned short *port)
 {
-    char path[PATH_MAX_TEXT];
-    if (port == NULL || !cache_pid_path(path, sizeof(path)))
-        return 0;
-    FILE *file = fopen(path, "re");
-    if (file == NULL)
-        return 0;
-
-    char line[PID_TEXT_SIZE];
-    char kept[PID_TEXT_SIZE];
-    memset(kept, 0, sizeof(kept));
-    while (fgets(line, PID_TEXT_SIZE, file) != NULL) {
-        if (strlen(line) >= 2)
-            memcpy(kept, line, sizeof(kept));
-    }
-    fclose(file);
-    return parse_port(kept, port);
+    char pid[PID_TEXT_SIZE];
+    char text[PID_TEXT_SIZE];
+    return port != NULL && read_pid_lines(pid, text) && parse_port(text, port);
 }

@@ -36,14 +36,12 @@ int is_cache_daemon_running(void);
 
 /* Sends one ready-made frame to the cache daemon and receives its reply body into reply. */
 int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity) KEST_MUST_USE;
-/* As socket_query, but takes the whole reply frame, however many receives it needs, within the same
- * receive time-out. On success *reply is the body, NUL-terminated, allocated with malloc for the caller
- * to free; a body longer than max_length is refused. */
+/* As socket_query, to the given port (0: the one in the pid file), but takes the whole reply frame,
+ * however many receives it needs, within the same receive time-out. On success *reply is the body,
+ * NUL-terminated, allocated with malloc for the caller to free; a body longer than max_length is
+ * refused. */
 int socket_query_frame(
-    const void *request, size_t request_length, char **reply, size_t *reply_length, size_t max_length) KEST_MUST_USE;
-/* As socket_query_frame, to the given port; 0 reads the port from the pid file. */
-int socket_query_frame_to(unsigned short port, const void *request, size_t request_length, char **reply,
-    size_t *reply_length, size_t max_length) KEST_MUST_USE;
+    unsigned short port, const void *request, size_t request_length, char **reply, size_t max_length) KEST_MUST_USE;
 int is_connect(int socket);
 int read_port(unsigned short *port);
 /* One read of the pid file: the port of the cache daemon when the pid it names runs cache-kest. */

@@ -28,16 +28,11 @@ static void find_self(void)
     self_is_daemon = get_process_name(process) && strcmp(process, "cache-kest") == 0;
 }
 
-static int daemon_port(unsigned short *port)
+unsigned short kest_daemon_port(void)
 {
     pthread_once(&self_once, find_self);
-    return !self_is_daemon && cache_daemon_port(port);
-}
-
-int kest_daemon_reachable(void)
-{
     unsigned short port = 0;
-    return daemon_port(&port);
+    return !self_is_daemon && cache_daemon_port(&port) ? port : 0;
 }
 
 static int append_raw(char *out, size_t size, size_t *length, const char *text)
@@ -104,15 +99,14 @@ static size_t build_request(char *out, size_t size, const char *function, const 
     return length;
 }
 
-int kest_call(const char *function, const char *const *argv, size_t argc, char **reply)
+int kest_call(unsigned short port, const char *function, const char *const *argv, size_t argc, char **reply)
 {
     *reply = NULL;
-    unsigned short port = 0;
-    if (!daemon_port(&port))
+    if (port == 0)
         return 0;
     char request[REQUEST_SIZE];
     size_t length = build_request(request, sizeof(request), function, argv, argc);
-    int answered = length > 0 && socket_query_frame_to(port, request, length, reply, NULL, REPLY_LIMIT);
+    int answered = length > 0 && socket_query_frame(port, request, length, reply, REPLY_LIMIT);
     explicit_bzero(request, sizeof(request));
     if (length == 0)
         log_message(3, SOURCE_PATH, __LINE__, __func__, "request %s too long for cache-kest", function);

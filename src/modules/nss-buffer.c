@@ -36,8 +36,6 @@ static char *take(struct nss_buffer *buffer, size_t size)
 
 char *nss_buffer_copy(struct nss_buffer *buffer, const char *text, size_t length)
 {
-    if (length >= buffer->left)
-        return short_of_room(buffer);
     char *copy = take(buffer, length + 1);
     if (copy == NULL)
         return NULL;
@@ -85,4 +83,16 @@ enum nss_status nss_buffer_status(const struct nss_buffer *buffer, int *errnop)
         return NSS_STATUS_TRYAGAIN;
     }
     return NSS_STATUS_SUCCESS;
+}
+
+enum nss_status nss_not_found(int *errnop)
+{
+    *errnop = ENOENT;
+    return NSS_STATUS_NOTFOUND;
+}
+
+enum nss_status nss_unavailable(int *errnop)
+{
+    *errnop = ENOENT;
+    return NSS_STATUS_UNAVAIL;
 }

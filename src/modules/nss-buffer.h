@@ -28,4 +28,8 @@ void nss_buffer_reject(struct nss_buffer *buffer);
  * retries with a larger one; NSS_STATUS_UNAVAIL with ENOENT for a value of the wrong form. */
 enum nss_status nss_buffer_status(const struct nss_buffer *buffer, int *errnop);
 
+/* NSS_STATUS_NOTFOUND and NSS_STATUS_UNAVAIL, each with ENOENT. */
+enum nss_status nss_not_found(int *errnop);
+enum nss_status nss_unavailable(int *errnop);
+
 #endif

@@ -2,6 +2,7 @@
 #define _GNU_SOURCE
 #include "common.h"
 #include "nss-buffer.h"
+#include "nss-listing.h"
 #include "paths.h"
 
 #include <errno.h>
@@ -40,18 +41,6 @@ struct group_line {
     const char *members;
     size_t members_length;
 };
-
-static enum nss_status unavailable(int *errnop)
-{
-    *errnop = ENOENT;
-    return NSS_STATUS_UNAVAIL;
-}
-
-static enum nss_status not_found(int *errnop)
-{
-    *errnop = ENOENT;
-    return NSS_STATUS_NOTFOUND;
-}
 
 /* The whole file, NUL-terminated, for the caller to free; NULL when it cannot be read. */
 static char *read_group_file(void)
@@ -200,7 +189,7 @@ static enum nss_status find_group(
 {
     char *text = read_group_file();
     if (text == NULL)
-        return unavailable(errnop);
+        return nss_unavailable(errnop);
     enum nss_status status = NSS_STATUS_NOTFOUND;
     struct group_line line;
     for (const char *p = text; *p != '\0';) {
@@ -211,13 +200,13 @@ static enum nss_status find_group(
         }
     }
     free(text);
-    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
+    return status == NSS_STATUS_NOTFOUND ? nss_not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_getgrnam_r(const char *name, struct group *grp, char *buffer, size_t buflen, int *errnop)
 {
     if (name == NULL || name[0] == '\0')
-        return not_found(errnop);
+        return nss_not_found(errnop);
     return find_group(has_name, name, grp, buffer, buflen, errnop);
 }
 
@@ -226,10 +215,7 @@ enum nss_status _nss_kest_getgrgid_r(gid_t gid, struct group *grp, char *buffer,
     return find_group(has_gid, &gid, grp, buffer, buflen, errnop);
 }
 
-static pthread_mutex_t listing_lock = PTHREAD_MUTEX_INITIALIZER;
-static char *listing;
-static const char *next_line;
-static int listing_taken;
+static struct nss_listing group_walk = NSS_LISTING_INIT;
 static int shows_all_special;
 static int shows_printing;
 
@@ -249,62 +235,44 @@ static int shown_in_listing(const struct group_line *line)
     return shows_printing && (strcmp(name, "lp") == 0 || strcmp(name, "lpadmin") == 0);
 }
 
-static void drop_listing(void)
+static void take_groups(struct nss_listing *listing)
 {
-    free(listing);
-    listing = NULL;
-    next_line = NULL;
-    listing_taken = 0;
-}
-
-static void take_listing(void)
-{
-    listing_taken = 1;
     shows_all_special = is_trusted_caller();
     shows_printing = is_printer_caller();
-    listing = read_group_file();
-    next_line = listing;
+    listing->text = read_group_file();
+    listing->next = listing->text;
 }
 
 enum nss_status _nss_kest_setgrent(int stayopen)
 {
     (void)stayopen;
-    pthread_mutex_lock(&listing_lock);
-    drop_listing();
-    take_listing();
-    pthread_mutex_unlock(&listing_lock);
-    return NSS_STATUS_SUCCESS;
+    return nss_listing_restart(&group_walk, take_groups);
 }
 
 enum nss_status _nss_kest_getgrent_r(struct group *grp, char *buffer, size_t buflen, int *errnop)
 {
-    pthread_mutex_lock(&listing_lock);
-    if (!listing_taken)
-        take_listing();
+    nss_listing_lock(&group_walk, take_groups);
     enum nss_status status = NSS_STATUS_NOTFOUND;
-    while (next_line != NULL && *next_line != '\0') {
+    while (group_walk.next != NULL && *group_walk.next != '\0') {
         struct group_line line;
-        const char *after = read_line(next_line, &line);
+        const char *after = read_line(group_walk.next, &line);
         if (!line.valid || !shown_in_listing(&line)) {
-            next_line = after;
+            group_walk.next = after;
             continue;
         }
         status = fill_group(&line, grp, buffer, buflen, errnop);
         /* A short buffer keeps the line for glibc's retry with a larger one. */
         if (status != NSS_STATUS_TRYAGAIN)
-            next_line = after;
+            group_walk.next = after;
         break;
     }
-    pthread_mutex_unlock(&listing_lock);
-    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
+    pthread_mutex_unlock(&group_walk.lock);
+    return status == NSS_STATUS_NOTFOUND ? nss_not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_endgrent(void)
 {
-    pthread_mutex_lock(&listing_lock);
-    drop_listing();
-    pthread_mutex_unlock(&listing_lock);
-    return NSS_STATUS_SUCCESS;
+    return nss_listing_end(&group_walk);
 }
 
 static enum nss_status add_group(
@@ -338,10 +306,10 @@ enum nss_status _nss_kest_initgroups_dyn(
 {
     /* Only network accounts are listed here beyond what the machine's own groups hold. */
     if (user == NULL || user[0] != '@')
-        return not_found(errnop);
+        return nss_not_found(errnop);
     char *text = read_group_file();
     if (text == NULL)
-        return unavailable(errnop);
+        return nss_unavailable(errnop);
     enum nss_status status = NSS_STATUS_SUCCESS;
     struct group_line line;
     for (const char *p = text; *p != '\0' && status == NSS_STATUS_SUCCESS;) {

@@ -3,6 +3,7 @@
 #include "daemon-client.h"
 #include "json-reader.h"
 #include "nss-buffer.h"
+#include "nss-listing.h"
 
 #include <errno.h>
 #include <nss.h>
@@ -52,38 +53,27 @@ static enum nss_status fill_passwd(const char *user, struct passwd *pwd, char *b
     return status;
 }
 
-static enum nss_status unavailable(int *errnop)
-{
-    *errnop = ENOENT;
-    return NSS_STATUS_UNAVAIL;
-}
-
-static enum nss_status not_found(int *errnop)
-{
-    *errnop = ENOENT;
-    return NSS_STATUS_NOTFOUND;
-}
-
 /* The cached entry; only when there is none, one query that lets the daemon ask the domain server,
  * then a second read of the entry. */
 static enum nss_status look_up(const char *read_function, const char *query_function, const char *key,
     struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
 {
     char *reply = NULL;
-    if (!kest_call(read_function, &key, 1, &reply))
-        return unavailable(errnop);
+    const unsigned short port = kest_daemon_port();
+    if (!kest_call(port, read_function, &key, 1, &reply))
+        return nss_unavailable(errnop);
     if (!kest_reply_passed(reply)) {
         free(reply);
-        int known = kest_call(query_function, &key, 1, &reply) && kest_reply_passed(reply);
+        int known = kest_call(port, query_function, &key, 1, &reply) && kest_reply_passed(reply);
         free(reply);
         if (!known)
-            return not_found(errnop);
-        if (!kest_call(read_function, &key, 1, &reply))
-            return unavailable(errnop);
+            return nss_not_found(errnop);
+        if (!kest_call(port, read_function, &key, 1, &reply))
+            return nss_unavailable(errnop);
     }
     enum nss_status status = kest_reply_passed(reply)
         ? fill_passwd(json_member(reply, "user"), pwd, buffer, buflen, errnop)
-        : not_found(errnop);
+        : nss_not_found(errnop);
     free(reply);
     return status;
 }
@@ -92,78 +82,55 @@ enum nss_status _nss_kest_getpwnam_r(const char *name, struct passwd *pwd, char 
 {
     /* Local accounts never pay for this module: no network name, no work at all. */
     if (name == NULL || name[0] != '@' || name[1] == '\0')
-        return not_found(errnop);
+        return nss_not_found(errnop);
     return look_up("getAccountByName", "queryAccountName", name, pwd, buffer, buflen, errnop);
 }
 
 enum nss_status _nss_kest_getpwuid_r(uid_t uid, struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
 {
     if (uid < FIRST_DOMAIN_UID)
-        return not_found(errnop);
+        return nss_not_found(errnop);
     char text[UID_TEXT_SIZE];
     snprintf(text, sizeof(text), "%u", (unsigned int)uid);
     return look_up("getAccountByUid", "queryUid", text, pwd, buffer, buflen, errnop);
 }
 
-/* Enumeration: glibc serialises it per process already; the lock keeps the list sound for any
- * other caller of these symbols. */
-static pthread_mutex_t listing_lock = PTHREAD_MUTEX_INITIALIZER;
-static char *listing;
-static const char *next_entry;
-static int listing_taken;
-
-static void drop_listing(void)
-{
-    free(listing);
-    listing = NULL;
-    next_entry = NULL;
-    listing_taken = 0;
-}
+static struct nss_listing account_walk = NSS_LISTING_INIT;
 
 /* Only the accounts daemon, which feeds the login screen's user list, enumerates network accounts:
  * every other walk of the user database stays local and never pulls the whole cache. */
-static void take_listing(void)
+static void take_accounts(struct nss_listing *listing)
 {
-    listing_taken = 1;
-    if (!is_accounts_daemon() || !kest_call("listAccounts", NULL, 0, &listing))
+    if (!is_accounts_daemon() || !kest_call(kest_daemon_port(), "listAccounts", NULL, 0, &listing->text))
         return;
-    if (kest_reply_passed(listing))
-        next_entry = json_first(json_member(listing, "users"));
+    if (kest_reply_passed(listing->text))
+        listing->next = json_first(json_member(listing->text, "users"));
 }
 
 enum nss_status _nss_kest_setpwent(int stayopen)
 {
     (void)stayopen;
-    pthread_mutex_lock(&listing_lock);
-    drop_listing();
-    take_listing();
-    pthread_mutex_unlock(&listing_lock);
-    return NSS_STATUS_SUCCESS;
+    return nss_listing_restart(&account_walk, take_accounts);
 }
 
 enum nss_status _nss_kest_getpwent_r(struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
 {
-    pthread_mutex_lock(&listing_lock);
-    if (!listing_taken)
-        take_listing();
+    nss_listing_lock(&account_walk, take_accounts);
     enum nss_status status = NSS_STATUS_NOTFOUND;
-    while (next_entry != NULL && status == NSS_STATUS_NOTFOUND) {
-        status = fill_passwd(next_entry, pwd, buffer, buflen, errnop);
+    while (account_walk.next != NULL && status == NSS_STATUS_NOTFOUND) {
+        status = fill_passwd(account_walk.next, pwd, buffer, buflen, errnop);
         /* A short buffer keeps the entry for glibc's retry; a malformed one is passed over. */
         if (status == NSS_STATUS_TRYAGAIN)
             break;
-        next_entry = json_next(next_entry);
+        account_walk.next = json_next(account_walk.next);
         if (status == NSS_STATUS_UNAVAIL)
             status = NSS_STATUS_NOTFOUND;
     }
-    pthread_mutex_unlock(&listing_lock);
-    return status == NSS_STATUS_NOTFOUND ? not_found(errnop) : status;
+    pthread_mutex_unlock(&account_walk.lock);
+    return status == NSS_STATUS_NOTFOUND ? nss_not_found(errnop) : status;
 }
 
 enum nss_status _nss_kest_endpwent(void)
 {
-    pthread_mutex_lock(&listing_lock);
-    drop_listing();
-    pthread_mutex_unlock(&listing_lock);
-    return NSS_STATUS_SUCCESS;
+    return nss_listing_end(&account_walk);
 }

@@ -60,10 +60,10 @@ static int result_of(enum stage stage, enum answer answer, const char *user, con
     return results[stage][answer];
 }
 
-static enum answer ask(const char *function, const char *const *argv, size_t argc)
+static enum answer ask(unsigned short port, const char *function, const char *const *argv, size_t argc)
 {
     char *reply = NULL;
-    if (!kest_call(function, argv, argc, &reply))
+    if (!kest_call(port, function, argv, argc, &reply))
         return ANSWER_NO_DAEMON;
     enum answer answer = kest_reply_passed(reply) ? ANSWER_YES : ANSWER_NO;
     free(reply);
@@ -77,14 +77,15 @@ PAM_EXTERN int pam_sm_authenticate(pam_handle_t *pamh, int flags, int argc, cons
     const char *user = network_user(pamh);
     if (user == NULL)
         return PAM_USER_UNKNOWN;
-    if (!kest_daemon_reachable())
+    const unsigned short port = kest_daemon_port();
+    if (port == 0)
         return result_of(STAGE_AUTH, ANSWER_NO_DAEMON, user, &options);
     const char *password = NULL;
     int got = pam_get_authtok(pamh, PAM_AUTHTOK, &password, NULL);
     if (got != PAM_SUCCESS || password == NULL)
         return got == PAM_SUCCESS ? PAM_AUTH_ERR : got;
     const char *arguments[] = { user, password };
-    return result_of(STAGE_AUTH, ask("authenticatePassword", arguments, 2), user, &options);
+    return result_of(STAGE_AUTH, ask(port, "authenticatePassword", arguments, 2), user, &options);
 }
 
 PAM_EXTERN int pam_sm_setcred(pam_handle_t *pamh, int flags, int argc, const char **argv)
@@ -103,7 +104,7 @@ PAM_EXTERN int pam_sm_acct_mgmt(pam_handle_t *pamh, int flags, int argc, const c
     const char *user = network_user(pamh);
     if (user == NULL)
         return PAM_IGNORE;
-    return result_of(STAGE_ACCOUNT, ask("getAccountByName", &user, 1), user, &options);
+    return result_of(STAGE_ACCOUNT, ask(kest_daemon_port(), "getAccountByName", &user, 1), user, &options);
 }
 
 /* The daemon's answer to a change: code 0 is success; any other answer's "msg" goes to the user. */
@@ -120,7 +121,7 @@ static enum answer change_answer(pam_handle_t *pamh, int flags, const char *repl
 }
 
 static enum answer change_password(
-    pam_handle_t *pamh, int flags, const char *user, const char *password, const char *old)
+    pam_handle_t *pamh, int flags, unsigned short port, const char *user, const char *password, const char *old)
 {
     char request[CHANGE_REQUEST_SIZE];
     const char *const fields[] = { "username", user, "password", password, "old_password", old };
@@ -131,7 +132,7 @@ static enum answer change_password(
     }
     const char *arguments[] = { request };
     char *reply = NULL;
-    int answered = kest_call("modifyUser", arguments, 1, &reply);
+    int answered = kest_call(port, "modifyUser", arguments, 1, &reply);
     explicit_bzero(request, sizeof(request));
     if (!answered)
         return ANSWER_NO_DAEMON;
@@ -146,7 +147,8 @@ PAM_EXTERN int pam_sm_chauthtok(pam_handle_t *pamh, int flags, int argc, const c
     const char *user = network_user(pamh);
     if (user == NULL)
         return PAM_IGNORE;
-    if (!kest_daemon_reachable())
+    const unsigned short port = kest_daemon_port();
+    if (port == 0)
         return result_of(STAGE_PASSWORD, ANSWER_NO_DAEMON, user, &options);
     if (flags & PAM_PRELIM_CHECK)
         return PAM_SUCCESS;
@@ -157,7 +159,7 @@ PAM_EXTERN int pam_sm_chauthtok(pam_handle_t *pamh, int flags, int argc, const c
         got = pam_get_authtok(pamh, PAM_AUTHTOK, &password, NULL);
     if (got != PAM_SUCCESS || old == NULL || password == NULL)
         return got == PAM_SUCCESS ? PAM_AUTHTOK_ERR : got;
-    return result_of(STAGE_PASSWORD, change_password(pamh, flags, user, password, old), user, &options);
+    return result_of(STAGE_PASSWORD, change_password(pamh, flags, port, user, password, old), user, &options);
 }
 
 PAM_EXTERN int pam_sm_open_session(pam_handle_t *pamh, int flags, int argc, const char **argv)
