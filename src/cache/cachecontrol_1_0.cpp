@@ -118,7 +118,12 @@ bool CacheControl_1_0::readFromFile(const QString &path)
         warnNotExists(path);
         return false;
     }
-    QDataStream stream(&file);
+    return readFromDevice(file);
+}
+
+bool CacheControl_1_0::readFromDevice(QIODevice &device)
+{
+    QDataStream stream(&device);
     readUInt32(stream, m_version);
     if (m_version != kCacheVersion1_0) {
         qWarning().noquote() << QStringLiteral("version ") + QString::number(m_version) + QStringLiteral(" error");

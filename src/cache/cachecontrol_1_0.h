@@ -13,6 +13,7 @@ public:
 
     bool writeToFile(const QString &path) override;
     bool readFromFile(const QString &path) override;
+    bool readFromDevice(QIODevice &device) override;
     quint32 version() const override;
     bool verifyEncryptedZone() const override;
     bool isCacheEffective() const override;

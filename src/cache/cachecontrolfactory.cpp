@@ -3,7 +3,7 @@
 #include "cachecontrol_1_0.h"
 #include "settingsfile.h"
 
-#include <QFile>
+#include <QIODevice>
 #include <QJsonObject>
 #include <QtEndian>
 
@@ -33,13 +33,10 @@ quint32 cacheVersionOfJson(const QString &json)
     return quint32(version) == kCacheVersion1_0 ? kCacheVersion1_0 : 0;
 }
 
-quint32 cacheVersionOfFile(const QString &path)
+quint32 cacheVersionOfDevice(QIODevice &device)
 {
-    QFile file(path);
-    if (!file.open(QIODevice::ReadOnly))
-        return 0;
     uchar bytes[4];
-    if (file.read(reinterpret_cast<char *>(bytes), sizeof(bytes)) != qint64(sizeof(bytes)))
+    if (device.peek(reinterpret_cast<char *>(bytes), sizeof(bytes)) != qint64(sizeof(bytes)))
         return 0;
     return qFromLittleEndian<quint32>(bytes) == kCacheVersion1_0 ? kCacheVersion1_0 : 0;
 }

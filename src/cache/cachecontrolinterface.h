@@ -6,6 +6,7 @@
 #include <QStringList>
 
 class QDataStream;
+class QIODevice;
 
 // Format version 1.0 of a cache record (major version in the high byte).
 constexpr quint32 kCacheVersion1_0 = 0x01000000;
@@ -22,6 +23,8 @@ public:
     // Output recomputes the encrypted zone, hence the non-const writers.
     virtual bool writeToFile(const QString &path) = 0;
     virtual bool readFromFile(const QString &path) = 0;
+    // As readFromFile, from a file already open at its start.
+    virtual bool readFromDevice(QIODevice &device) = 0;
     // The format version of the class, not the stored field (see storedVersion()).
     virtual quint32 version() const = 0;
     virtual bool verifyEncryptedZone() const = 0;

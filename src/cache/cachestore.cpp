@@ -46,20 +46,11 @@ struct ReadRecords {
     QHash<quint32, Entry> entries;
 };
 constexpr int kReadRecordsKept = 256;
-// Well above the tick of the file system's time stamps.
-constexpr int kSettleMs = 100;
 
 ReadRecords &readRecords()
 {
     static ReadRecords instance;
     return instance;
-}
-
-void forgetReadRecord(quint32 uid)
-{
-    ReadRecords &kept = readRecords();
-    std::lock_guard<std::mutex> lock(kept.mutex);
-    kept.entries.remove(uid);
 }
 
 CacheControlPtr recordHolding(quint32 uid, const QString &account)
@@ -104,7 +95,6 @@ bool cacheFileExists(const CacheControlInterface &record)
 
 bool saveCacheRecord(CacheControlInterface &record)
 {
-    forgetReadRecord(record.uid());
     return record.writeToFile(cacheFilePath(record));
 }
 
@@ -112,8 +102,9 @@ bool loadCacheRecord(CacheControlPtr &record)
 {
     if (!record)
         return false;
-    const QString path = cacheFilePath(*record);
-    const quint32 fileVersion = cacheVersionOfFile(path);
+    // One open serves both the version and the fields.
+    QFile file(cacheFilePath(*record));
+    const quint32 fileVersion = file.open(QIODevice::ReadOnly) ? cacheVersionOfDevice(file) : 0;
     if (fileVersion != record->version()) {
         const quint32 uid = record->uid();
         record = createCacheControl(fileVersion);
@@ -121,7 +112,7 @@ bool loadCacheRecord(CacheControlPtr &record)
             return false;
         record->setUid(uid);
     }
-    return record->readFromFile(path);
+    return record->readFromDevice(file);
 }
 
 CacheControlPtr readCacheRecord(quint32 uid)
@@ -131,7 +122,7 @@ CacheControlPtr readCacheRecord(quint32 uid)
     const FileVersion version = FileVersion::of(path, false);
     if (!version.isRegularFile())
         return CacheControlPtr();
-    const bool settled = !version.isRecent(kSettleMs);
+    const bool settled = version.isSettled();
     ReadRecords &kept = readRecords();
     {
         std::lock_guard<std::mutex> lock(kept.mutex);
@@ -146,8 +137,9 @@ CacheControlPtr readCacheRecord(quint32 uid)
     if (!settled)
         return record;
     std::lock_guard<std::mutex> lock(kept.mutex);
-    if (kept.entries.size() >= kReadRecordsKept)
-        kept.entries.clear();
+    // One out for one in: a walk over the whole store must not flush the records in use.
+    if (kept.entries.size() >= kReadRecordsKept && !kept.entries.contains(uid))
+        kept.entries.erase(kept.entries.begin());
     kept.entries.insert(uid, { version, record });
     return record;
 }
@@ -227,7 +219,6 @@ bool findCacheUidByAccount(const QString &account, quint32 &uid, quint32 knownUi
 
 void removeCacheFile(quint32 uid)
 {
-    forgetReadRecord(uid);
     const QString path = cacheFilePathOfUid(uid);
     if (QFile::exists(path))
         QFile::remove(path);

@@ -150,7 +150,7 @@ void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &p
 }
 
 // The service may have waited on the domain server long enough for the peer to give up.
-bool KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &framed)
+void KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &framed)
 {
     char byte;
     const bool peerLeft = socket->state() != QAbstractSocket::ConnectedState
@@ -160,12 +160,11 @@ bool KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &fram
             ? QStringLiteral("The remote host closed the connection")
             : socket->errorString();
         qWarning().noquote() << QStringLiteral("socket error: ") + reason;
-        return false;
+        return;
     }
     socket->write(framed);
     // Out now: the client is waiting, and the event loop would send it only on its next turn.
     socket->flush();
-    return true;
 }
 
 void KestCacheLocalServer::sendErrorReply(QTcpSocket *socket, const QString &text)

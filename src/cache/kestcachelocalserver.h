@@ -31,7 +31,7 @@ private Q_SLOTS:
 
 private:
     void handleRequest(QTcpSocket *socket, const QByteArray &payload);
-    bool writeReply(QTcpSocket *socket, const QByteArray &framed);
+    void writeReply(QTcpSocket *socket, const QByteArray &framed);
     void watchPartialFrame(QTcpSocket *socket);
     void sendErrorReply(QTcpSocket *socket, const QString &text);
     QString sendResultReply(QTcpSocket *socket, int retVal, const QString &text);

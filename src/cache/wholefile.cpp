@@ -17,7 +17,11 @@ bool WholeFile::write(
         error = file.errorString();
         return false;
     }
+    // A full disk must not pass for a written file.
     file.setPermissions(permissions);
-    file.write(content);
+    if (file.write(content) != content.size() || !file.flush()) {
+        error = file.errorString();
+        return false;
+    }
     return true;
 }

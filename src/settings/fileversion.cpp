@@ -21,13 +21,16 @@ FileVersion FileVersion::of(const QString &path, bool followLinks)
     return version;
 }
 
-bool FileVersion::isRecent(int milliseconds) const
+bool FileVersion::isSettled() const
 {
     const auto nanoseconds = [](const timespec &time) { return qint64(time.tv_sec) * 1000000000 + time.tv_nsec; };
+    // Well above a clock tick; time stamps without fractions may come from a file system that counts whole
+    // seconds, where the same second is the same tick.
+    const bool wholeSeconds = m_modified.tv_nsec == 0 && m_changed.tv_nsec == 0;
+    const qint64 window = (wholeSeconds ? 1100 : 100) * qint64(1000000);
     timespec now {};
     clock_gettime(CLOCK_REALTIME, &now);
-    const qint64 latest = qMax(nanoseconds(m_modified), nanoseconds(m_changed));
-    return nanoseconds(now) - latest < qint64(milliseconds) * 1000000;
+    return nanoseconds(now) - qMax(nanoseconds(m_modified), nanoseconds(m_changed)) >= window;
 }
 
 bool FileVersion::operator==(const FileVersion &other) const

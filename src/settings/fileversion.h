@@ -14,10 +14,10 @@ public:
 
     bool exists() const { return m_exists; }
     bool isRegularFile() const { return m_regular; }
-    // A file changed this recently may change again within the same time stamp, unseen by a comparison.
-    bool isRecent(int milliseconds) const;
+    // Whether a later change is sure to show in the time stamps. One made within the same tick of the file
+    // system's clock would not, so what was read of a file changed that recently must not be kept.
+    bool isSettled() const;
     bool operator==(const FileVersion &other) const;
-    bool operator!=(const FileVersion &other) const { return !(*this == other); }
 
 private:
     bool m_exists = false;

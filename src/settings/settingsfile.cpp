@@ -15,6 +15,7 @@ struct Cache {
     QString path;
     FileVersion version;
     bool loaded = false;
+    bool settled = false; // the file had settled when it was parsed: an unchanged version means unchanged values
     QHash<QString, QVariant> values;
 };
 
@@ -35,7 +36,7 @@ void refresh(Cache &settings)
     const QString path = KestPaths::settingsFile();
     const FileVersion now = FileVersion::of(path);
     lookedOnce = oneLookDepth > 0;
-    if (settings.loaded && now == settings.version && path == settings.path)
+    if (settings.loaded && settings.settled && now == settings.version && path == settings.path)
         return;
     settings.values.clear();
     const QSettings file(path, QSettings::IniFormat);
@@ -44,6 +45,7 @@ void refresh(Cache &settings)
         settings.values.insert(name, file.value(name));
     settings.path = path;
     settings.version = now;
+    settings.settled = now.isSettled();
     settings.loaded = true;
 }
 } // namespace
