@@ -33,6 +33,7 @@
 
 #include <algorithm>
 #include <functional>
+#include <utility>
 
 #include <dlfcn.h>
 #include <pwd.h>
@@ -87,6 +88,19 @@ QList<double> measure(int count, const std::function<void()> &action, Floor *flo
         samples << timed(action);
     }
     return samples;
+}
+
+// The look-up and the login rows of one state of the daemon, each sample beside one of the floor's.
+QList<Row> lookUpAndLogin(
+    const QString &state, quint16 port, const QByteArray &lookUp, const QByteArray &login, int count, Floor &floor)
+{
+    QList<Row> rows;
+    for (const auto &[kind, frame] : { std::pair { "look-up, ", &lookUp }, std::pair { "login, ", &login } })
+        rows << Row { QLatin1String(kind) + state,
+            measure(
+                count, [&] { roundTrip(port, *frame); }, &floor),
+            floor.row.name };
+    return rows;
 }
 
 QByteArray call(const char *function, const QStringList &argv)
@@ -275,14 +289,7 @@ QList<Row> scaleRows(int count, Floor &floor, QStringList &notes)
     const QByteArray lookUp = call("queryAccountName", { name });
     const QByteArray login = call("authenticatePassword", { name, QStringLiteral("pw") });
     roundTrip(daemon.port(), lookUp);
-    rows << Row { QStringLiteral("look-up, offline") + label,
-        measure(
-            200, [&] { roundTrip(daemon.port(), lookUp); }, &floor),
-        floor.row.name };
-    rows << Row { QStringLiteral("login, offline") + label,
-        measure(
-            200, [&] { roundTrip(daemon.port(), login); }, &floor),
-        floor.row.name };
+    rows << lookUpAndLogin(QStringLiteral("offline") + label, daemon.port(), lookUp, login, 200, floor);
     notes << QStringLiteral("cache-kest RSS with %1 records: ").arg(count) + rssOf(daemon.processId());
     return rows;
 }
@@ -359,25 +366,11 @@ int main(int argc, char *argv[])
         QString() };
 
     roundTrip(daemon.port(), login);
-    rows << Row { QStringLiteral("look-up, online"),
-        measure(
-            count, [&] { roundTrip(daemon.port(), lookUp); }, &kept),
-        kept.row.name };
-    rows << Row { QStringLiteral("login, online"),
-        measure(
-            count, [&] { roundTrip(daemon.port(), login); }, &kept),
-        kept.row.name };
+    rows << lookUpAndLogin(QStringLiteral("online"), daemon.port(), lookUp, login, count, kept);
 
     server.stop();
     roundTrip(daemon.port(), lookUp);
-    rows << Row { QStringLiteral("look-up, offline"),
-        measure(
-            count, [&] { roundTrip(daemon.port(), lookUp); }, &loopback),
-        loopback.row.name };
-    rows << Row { QStringLiteral("login, offline"),
-        measure(
-            count, [&] { roundTrip(daemon.port(), login); }, &loopback),
-        loopback.row.name };
+    rows << lookUpAndLogin(QStringLiteral("offline"), daemon.port(), lookUp, login, count, loopback);
     const QString rss = rssOf(daemon.processId());
     rows << moduleRows(loopback);
 
