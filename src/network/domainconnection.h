@@ -20,12 +20,12 @@ struct DomainEndpoint {
     quint16 port = 0;
     bool tls = false;
     QString verifyName; // empty: the server was given as a literal address
-    QString tlsKey; // names the TLS settings (files and their times) the configuration was built from
+    quint64 tlsGeneration = 0; // which build of the TLS configuration the connection uses
 
     bool operator==(const DomainEndpoint &other) const
     {
         return address == other.address && port == other.port && tls == other.tls && verifyName == other.verifyName
-            && tlsKey == other.tlsKey;
+            && tlsGeneration == other.tlsGeneration;
     }
 };
 

@@ -19,9 +19,9 @@
 #include <QTextStream>
 #include <QUrl>
 
+#include <algorithm>
 #include <initializer_list>
 #include <memory>
-#include <sys/stat.h>
 #include <utility>
 
 namespace
@@ -55,16 +55,6 @@ QString hostPortText(const QString &address, int port)
 {
     const bool ipv6 = QHostAddress(address).protocol() == QAbstractSocket::IPv6Protocol;
     return (ipv6 ? QLatin1Char('[') + address + QLatin1Char(']') : address) + QLatin1Char(':') + QString::number(port);
-}
-
-// Names the TLS files as they are now, so that an edited or replaced file rebuilds the configuration.
-QString fileStamp(const QString &path)
-{
-    struct stat info = {};
-    stat(QFile::encodeName(path).constData(), &info);
-    return path + QLatin1Char('@') + QString::number(info.st_mtim.tv_sec) + QLatin1Char('.')
-        + QString::number(info.st_mtim.tv_nsec) + QLatin1Char('/') + QString::number(info.st_size) + QLatin1Char('/')
-        + QString::number(info.st_ino);
 }
 
 QByteArray requestText(const QString &path, const QString &hostPort, const QByteArray &method, const QByteArray &body)
@@ -147,6 +137,7 @@ QDeadlineTimer HttpHelper::requestDeadline(int milliseconds) const
 
 bool HttpHelper::checkServerAddress(QString &hostPort, const std::atomic<bool> *cancel)
 {
+    const SettingsFile::OneLook settingsOnce;
     if (!SettingsFile::exists()) {
         warn(QStringLiteral("configuration file is broken."));
         return false;
@@ -181,10 +172,17 @@ bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configurat
     const QString caPath = settings->serverCert();
     const QString chainPath = settings->publicKey();
     const QString keyPath = settings->privateKey();
-    const QString key = fileStamp(caPath) + QLatin1Char('|') + fileStamp(chainPath) + QLatin1Char('|')
-        + fileStamp(keyPath) + QLatin1Char('|') + QString::number(literalAddress);
-    if (key != m_tlsKey) {
-        m_tlsKey = key;
+    const QStringList paths { caPath, chainPath, keyPath };
+    QVector<FileVersion> versions;
+    for (const QString &path : paths)
+        versions.append(FileVersion::of(path));
+    if (!m_tlsSettled || paths != m_tlsPaths || versions != m_tlsVersions || literalAddress != m_tlsLiteral) {
+        m_tlsPaths = paths;
+        m_tlsVersions = versions;
+        m_tlsLiteral = literalAddress;
+        m_tlsSettled
+            = std::all_of(versions.cbegin(), versions.cend(), [](const FileVersion &v) { return v.isSettled(); });
+        ++m_tlsGeneration;
         m_tlsConfiguration = QSslConfiguration::defaultConfiguration();
         m_tlsConfiguration.setPeerVerifyMode(QSslSocket::VerifyPeer);
         m_tlsConfiguration.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
@@ -226,7 +224,7 @@ bool HttpHelper::resolveTarget(Target &target)
     QSslConfiguration configuration;
     if (target.endpoint.tls && !configureSsl(literal, configuration))
         return false;
-    target.endpoint.tlsKey = target.endpoint.tls ? m_tlsKey : QString();
+    target.endpoint.tlsGeneration = target.endpoint.tls ? m_tlsGeneration : 0;
     m_connection.setEndpoint(target.endpoint, configuration);
     return true;
 }
@@ -234,8 +232,8 @@ bool HttpHelper::resolveTarget(Target &target)
 DomainExchange HttpHelper::sendRequest(const QString &url, const QByteArray &method, const QByteArray &body)
 {
     const QUrl parsed(url);
-    const QString path
-        = parsed.path(QUrl::FullyEncoded) + (parsed.hasQuery() ? QLatin1Char('?') + parsed.query() : QString());
+    const QString path = parsed.path(QUrl::FullyEncoded)
+        + (parsed.hasQuery() ? QLatin1Char('?') + parsed.query(QUrl::FullyEncoded) : QString());
     const QString hostPort = parsed.authority(QUrl::FullyEncoded);
     const QDeadlineTimer connectDeadline = requestDeadline(connectTimeoutMs);
     const QDeadlineTimer deadline = requestDeadline(GlobalSetting::instance()->networkTimeout() * 1000);
@@ -284,6 +282,7 @@ QString HttpHelper::readMachineId()
 bool HttpHelper::exchange(
     PathSetting path, const QByteArray &method, const BodyBuilder &body, QJsonObject &object, QString &failure)
 {
+    const SettingsFile::OneLook settingsOnce;
     failure = unreachableReply();
     m_lastAnswered = false;
     if (!SettingsFile::exists()) {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "domainconnection.h"
+#include "fileversion.h"
 
 #include <QByteArray>
 #include <QDeadlineTimer>
@@ -80,7 +81,13 @@ private:
 
     std::shared_ptr<ServerReachability> m_reachability;
     DomainConnection m_connection;
-    QString m_tlsKey;
+    // What the TLS configuration was built from: the three files as they were, and the address form.
+    // Built again when any of it changes, or while a file has not settled.
+    QStringList m_tlsPaths;
+    QVector<FileVersion> m_tlsVersions;
+    bool m_tlsLiteral = false;
+    bool m_tlsSettled = false;
+    quint64 m_tlsGeneration = 0;
     QSslConfiguration m_tlsConfiguration;
     bool m_tlsUsable = false;
     bool m_tlsOwnAuthorities = false;

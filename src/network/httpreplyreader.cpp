@@ -147,9 +147,11 @@ HttpReplyReader::State HttpReplyReader::takeChunks()
             if (end < 0)
                 return m_buffer.size() > maximumHeadBytes ? State::TooLarge : State::Incomplete;
             m_buffer.remove(0, end + lineEnd.size());
-            if (end == 0)
-                return State::Complete;
-            continue;
+            if (end != 0)
+                continue;
+            // As after a sized body: bytes past the answer put the connection out of step.
+            m_keepAlive = m_keepAlive && m_buffer.isEmpty();
+            return State::Complete;
         }
         if (m_chunkLeft < 0) {
             const int end = m_buffer.indexOf(lineEnd);
