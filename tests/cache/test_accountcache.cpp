@@ -151,25 +151,21 @@ private Q_SLOTS:
         QVERIFY(readCacheRecord(10001).isNull());
     }
 
+    // Each refusal logs one warning.
     void checkOfflineLogin_data()
     {
         QTest::addColumn<int>("days"); // the validity; below 0: offline login switched off
         QTest::addColumn<quint32>("removeStatus");
         QTest::addColumn<qint64>("age"); // seconds from the last login to now; below 0: no record
-        QTest::addColumn<QString>("warning"); // empty: allowed
-        const auto row = [](const char *name, int days, quint32 removeStatus, qint64 age, const char *warning) {
-            QTest::newRow(name) << days << removeStatus << age << QString::fromLatin1(warning);
-        };
-        const char *const expired = "[checkCacheEffectiveSeconds]: false";
+        QTest::addColumn<bool>("allowed");
         const qint64 week = 7 * 86400;
-        row("exactly seven days", 7, 0, week, "");
-        row("seven days and a second", 7, 0, week + 1, expired);
-        row("no record", 7, 0, -1, "[checkOfflineLogin]: Cache file not found");
-        row("marked for deletion", 7, 4000000000u, 0,
-            "[removeStatus]: The cache file is marked for deletion: 4000000000");
-        row("switched off", -7, 0, 0, "[offline_login_enable]: false");
+        QTest::newRow("exactly seven days") << 7 << 0u << week << true;
+        QTest::newRow("seven days and a second") << 7 << 0u << week + 1 << false;
+        QTest::newRow("no record") << 7 << 0u << qint64(-1) << false;
+        QTest::newRow("marked for deletion") << 7 << 4000000000u << qint64(0) << false;
+        QTest::newRow("switched off") << -7 << 0u << qint64(0) << false;
         // 49711 days are 63104 s in 32 bits: the validity wraps.
-        row("wrapped validity, past it", 49711, 0, 63105, expired);
+        QTest::newRow("wrapped validity, past it") << 49711 << 0u << qint64(63105) << false;
     }
 
     void checkOfflineLogin()
@@ -177,7 +173,6 @@ private Q_SLOTS:
         QFETCH(int, days);
         QFETCH(quint32, removeStatus);
         QFETCH(qint64, age);
-        QFETCH(QString, warning);
         QVERIFY(m_root.writeSettings("[offline_login]\nenable=" + QByteArray(days > 0 ? "true" : "false")
             + "\ncache_validity=" + QByteArray::number(qAbs(days)) + '\n'));
         // The decision depends on the current second: repeat when the clock moved on meanwhile.
@@ -189,9 +184,8 @@ private Q_SLOTS:
             QVERIFY(age < 0 || put("10001", recordFile(10001, "@alice", removeStatus, quint64(now - age))));
             allowed = ::checkOfflineLogin(QStringLiteral("@alice"));
         }
-        QCOMPARE(allowed, warning.isEmpty());
-        QCOMPARE(SyslogCapture::lines().size(), warning.isEmpty() ? 0 : 1);
-        QVERIFY(SyslogCapture::lines().value(0).text.endsWith(warning.toUtf8()));
+        QTEST(allowed, "allowed");
+        QCOMPARE(SyslogCapture::lines().size(), allowed ? 0 : 1);
     }
 
 private:

@@ -146,7 +146,6 @@ private Q_SLOTS:
         const QByteArray granted = "Password: pamtester: successfully authenticated\n";
         const QByteArray unknown = "pamtester: User not known to the underlying authentication module\n";
         const QByteArray change = "Current password: New password: Retype new password: ";
-        row("name", 0, "getent passwd @alice", 0, alice);
         row("uid", 0, "getent passwd 10002", 0, "@bob:x:10002:10000:Bob:/home/bob:/bin/bash\n");
         // This id walks the group list, which shows the special groups to system services only.
         row("id", 0, "id @alice", 0, "uid=10001(@alice) gid=10000(kest) groups=10000(kest)\n");
