@@ -35,12 +35,6 @@ QMutex peersLock;
 QStringList peerCalls;
 QString refusedMembers; // separated by spaces
 
-QStringList takeCalls()
-{
-    QMutexLocker locker(&peersLock);
-    return std::exchange(peerCalls, QStringList());
-}
-
 bool writeRecord(uint uid, const QString &name, uint removeStatus = 0)
 {
     const QString json = QStringLiteral(R"({"version": 16777216, "uid": %1, "main_gid": %2, "account": "%3",
@@ -142,7 +136,8 @@ private Q_SLOTS:
             "kest:x:10000:@alice,@bob\nlp:x:7:@alice,\nplotters:x:5003:@bob,\n"));
         QVERIFY(m_root.writeSettings(kOn));
         QVERIFY(writeRecord(10001, QStringLiteral("@alice")) && writeRecord(10002, QStringLiteral("@bob")));
-        takeCalls();
+        const QMutexLocker locker(&peersLock);
+        peerCalls.clear();
         refusedMembers.clear();
     }
 
@@ -165,15 +160,6 @@ private Q_SLOTS:
                 QStringLiteral("org.freedesktop.DBus.Introspectable"), QStringLiteral("Introspect"));
             QCOMPARE(block.match(m_conn.call(introspect).arguments().value(0).toString()).captured(), recorded);
         }
-        // A record marked for removal has no list entry: its object reads zeros and empty texts.
-        const QDBusMessage getAll = QDBusMessage::createMethodCall(kName, kPath + QStringLiteral("/user10003"),
-                                        QStringLiteral("org.freedesktop.DBus.Properties"), QStringLiteral("GetAll"))
-            << kName + QStringLiteral(".user");
-        const QVariantMap values = qdbus_cast<QVariantMap>(m_conn.call(getAll).arguments().value(0));
-        QCOMPARE(values.size(), 7);
-        for (const QVariant &value : values)
-            QVERIFY2(
-                value.toString().isEmpty() || value.toString() == QLatin1String("0"), qPrintable(value.toString()));
     }
 
     // The service object in this process, so that its cache and objects can be looked at. A row's name starts with
@@ -244,7 +230,8 @@ private Q_SLOTS:
             }
         }
         QTEST(last, "reply");
-        QStringList outcome = takeCalls();
+        QStringList outcome;
+        std::swap(outcome, (QMutexLocker(&peersLock), peerCalls));
         std::sort(outcome.begin(), outcome.begin() + outcome.filter(QStringLiteral("DeleteUser ")).size());
         QList<uint> uids = listCacheUids();
         std::sort(uids.begin(), uids.end());
@@ -330,6 +317,10 @@ private Q_SLOTS:
         row("root reads an entry", "--reuid=0", "/user10002", getAll,
             "({'Gecos': <'Full Name of @bob'>, 'Gid': <uint32 10102>, 'HomeDir': <'/home/remote/@bob'>, "
             "'Password': <'digest-of-@bob'>, 'Shell': <'/bin/zsh'>, 'Uid': <uint32 10002>, 'UserName': <'@bob'>},)");
+        // A record marked for removal has no list entry: its object reads zeros and empty texts.
+        row("root reads a removed entry", "--reuid=0", "/user10003", getAll,
+            "({'Gecos': <''>, 'Gid': <uint32 0>, 'HomeDir': <''>, 'Password': <''>, 'Shell': <''>, 'Uid': <uint32 0>, "
+            "'UserName': <''>},)");
     }
 
     void bus()
@@ -340,7 +331,7 @@ private Q_SLOTS:
         QFETCH(QByteArray, output);
         if (caller.isEmpty())
             QSKIP("this machine has no group sudo");
-        QVERIFY(writeRecord(65534, QStringLiteral("@nobody")));
+        QVERIFY(writeRecord(65534, QStringLiteral("@nobody")) && writeRecord(10003, QStringLiteral("@carol"), 1));
         announce("c4");
         QProcess client;
         client.start(QStringLiteral("setpriv"),
