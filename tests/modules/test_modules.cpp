@@ -27,42 +27,6 @@ class ModulesTest : public QObject
 
     static QByteArray modulePath(const char *name) { return qgetenv("KEST_TEST_BINARY_DIR") + "/src/modules/" + name; }
 
-    // "status errno entry" of one call into the module, the entry as a passwd or group line or a gid list.
-    QByteArray callNss(const QByteArray &call, const QByteArray &key, size_t size)
-    {
-        const auto nss = [this](const char *function, auto... arguments) {
-            return reinterpret_cast<nss_status (*)(decltype(arguments)...)>(dlsym(m_nss, function))(arguments...);
-        };
-        QByteArray buffer(int(size), '\0'), entry;
-        int error = 0, status;
-        passwd pwd {};
-        group grp {};
-        long start = 1, room = 1;
-        auto *groups = static_cast<gid_t *>(malloc(sizeof(gid_t)));
-        groups[0] = 10000;
-        if (call == "getpwnam")
-            status = nss("_nss_kest_getpwnam_r", key.constData(), &pwd, buffer.data(), size, &error);
-        else if (call == "getpwuid")
-            status = nss("_nss_kest_getpwuid_r", uid_t(key.toUInt()), &pwd, buffer.data(), size, &error);
-        else if (call == "getgrnam")
-            status = nss("_nss_kest_getgrnam_r", key.constData(), &grp, buffer.data(), size, &error);
-        else
-            status = nss("_nss_kest_initgroups_dyn", key.constData(), gid_t(10000), &start, &room, &groups, 0L, &error);
-        if (status == NSS_STATUS_SUCCESS && pwd.pw_name)
-            entry = QByteArrayList({ pwd.pw_name, pwd.pw_passwd, QByteArray::number(pwd.pw_uid),
-                                       QByteArray::number(pwd.pw_gid), pwd.pw_gecos, pwd.pw_dir, pwd.pw_shell })
-                        .join(':');
-        if (status == NSS_STATUS_SUCCESS && grp.gr_name) {
-            entry = QString::asprintf("%s:%s:%u:", grp.gr_name, grp.gr_passwd, grp.gr_gid).toUtf8();
-            for (char **member = grp.gr_mem; *member; ++member)
-                entry += QByteArray(*member) + (member[1] ? "," : "");
-        }
-        for (long i = 0; call == "initgroups" && i < start; ++i)
-            entry += QByteArray::number(groups[i]) + ' ';
-        free(groups);
-        return (QByteArray::number(status) + ' ' + QByteArray::number(error) + ' ' + entry).trimmed();
-    }
-
 private Q_SLOTS:
     void initTestCase()
     {
@@ -123,8 +87,42 @@ private Q_SLOTS:
         if (!answers.isEmpty())
             QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"),
                 QByteArray::number(m_daemon.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
+        // "status errno entry" of one call, the entry as a passwd or group line or a gid list.
         const QByteArrayList parts = call.split(' ');
-        const QByteArray result = callNss(parts.at(0), parts.at(1), parts.value(2, "1024").toUInt());
+        const QByteArray function = parts.at(0), key = parts.at(1);
+        const size_t size = parts.value(2, "1024").toUInt();
+        const auto nss = [this](const char *function, auto... arguments) {
+            return reinterpret_cast<nss_status (*)(decltype(arguments)...)>(dlsym(m_nss, function))(arguments...);
+        };
+        QByteArray buffer(int(size), '\0'), entry;
+        int error = 0, status;
+        passwd pwd {};
+        group grp {};
+        long start = 1, room = 1;
+        auto *groups = static_cast<gid_t *>(malloc(sizeof(gid_t)));
+        groups[0] = 10000;
+        if (function == "getpwnam")
+            status = nss("_nss_kest_getpwnam_r", key.constData(), &pwd, buffer.data(), size, &error);
+        else if (function == "getpwuid")
+            status = nss("_nss_kest_getpwuid_r", uid_t(key.toUInt()), &pwd, buffer.data(), size, &error);
+        else if (function == "getgrnam")
+            status = nss("_nss_kest_getgrnam_r", key.constData(), &grp, buffer.data(), size, &error);
+        else
+            status = nss("_nss_kest_initgroups_dyn", key.constData(), gid_t(10000), &start, &room, &groups, 0L, &error);
+        if (status == NSS_STATUS_SUCCESS && pwd.pw_name)
+            entry = QByteArrayList({ pwd.pw_name, pwd.pw_passwd, QByteArray::number(pwd.pw_uid),
+                                       QByteArray::number(pwd.pw_gid), pwd.pw_gecos, pwd.pw_dir, pwd.pw_shell })
+                        .join(':');
+        if (status == NSS_STATUS_SUCCESS && grp.gr_name) {
+            entry = QString::asprintf("%s:%s:%u:", grp.gr_name, grp.gr_passwd, grp.gr_gid).toUtf8();
+            for (char **member = grp.gr_mem; *member; ++member)
+                entry += QByteArray(*member) + (member[1] ? "," : "");
+        }
+        for (long i = 0; function == "initgroups" && i < start; ++i)
+            entry += QByteArray::number(groups[i]) + ' ';
+        free(groups);
+        const QByteArray result
+            = (QByteArray::number(status) + ' ' + QByteArray::number(error) + ' ' + entry).trimmed();
         QByteArrayList asked;
         for (const QByteArray &request : standIn.finish())
             asked.append(QJsonDocument::fromJson(request.mid(4))[QLatin1String("functionName")].toString().toUtf8());
@@ -146,7 +144,6 @@ private Q_SLOTS:
         const QByteArray granted = "Password: pamtester: successfully authenticated\n";
         const QByteArray unknown = "pamtester: User not known to the underlying authentication module\n";
         const QByteArray change = "Current password: New password: Retype new password: ";
-        row("name", 0, "getent passwd @alice", 0, alice);
         row("uid", 0, "getent passwd 10002", 0, "@bob:x:10002:10000:Bob:/home/bob:/bin/bash\n");
         // This id walks the group list, which shows the special groups to system services only.
         row("id", 0, "id @alice", 0, "uid=10001(@alice) gid=10000(kest) groups=10000(kest)\n");

@@ -6,9 +6,9 @@ namespace
 {
 const char addressVariable[] = "DBUS_SYSTEM_BUS_ADDRESS";
 
-QByteArray policyBlock(PrivateBus::Policy policy)
+QByteArray policyBlock(const QString &policyFile)
 {
-    if (policy == PrivateBus::Policy::Open)
+    if (policyFile.isEmpty())
         return "<policy context=\"default\"><allow user=\"*\"/><allow own=\"*\"/>\n"
                "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow receive_sender=\"*\"/></policy>\n";
     // Replies and signals pass; method calls only where a policy allows them, as on the machine's bus.
@@ -24,27 +24,28 @@ QByteArray policyBlock(PrivateBus::Policy policy)
     text += "</policy>\n<policy user=\"root\"><allow own=\"*\"/>\n";
     for (const char *peer : { "org.freedesktop.login1", "com.nimbal.daemon.Accounts", "com.nimbal.ose.LockService" })
         text += QByteArray("<allow send_type=\"method_call\" send_destination=\"") + peer + "\"/>\n";
-    return text + "</policy>\n";
+    return text + "</policy>\n<include>" + QFile::encodeName(policyFile) + "</include>\n";
 }
 } // namespace
 
-PrivateBus::PrivateBus(Policy policy, const QStringList &policyFiles)
+PrivateBus::PrivateBus(const QString &policyFile)
     : m_previousAddress(qgetenv(addressVariable))
     , m_hadPreviousAddress(qEnvironmentVariableIsSet(addressVariable))
 {
     QByteArray config = "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
                         " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
                         "<busconfig><type>system</type><auth>EXTERNAL</auth>\n<listen>unix:path="
-        + QFile::encodeName(m_dir.filePath(QStringLiteral("system_bus_socket"))) + "</listen>\n" + policyBlock(policy);
-    for (const QString &file : policyFiles)
-        config += "<include>" + QFile::encodeName(file) + "</include>\n";
-    config += "</busconfig>\n";
+        + QFile::encodeName(m_dir.filePath(QStringLiteral("system_bus_socket"))) + "</listen>\n"
+        + policyBlock(policyFile) + "</busconfig>\n";
     QFile configFile(m_dir.filePath(QStringLiteral("bus.conf")));
     if (!m_dir.isValid() || !configFile.open(QIODevice::WriteOnly) || configFile.write(config) != config.size()) {
         m_error = QStringLiteral("cannot write the bus configuration in ") + m_dir.path();
         return;
     }
     configFile.close();
+    QFile::setPermissions(m_dir.path(),
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner | QFileDevice::ExeGroup
+            | QFileDevice::ExeOther);
     m_daemon.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_daemon.start(QStringLiteral("dbus-daemon"),
         { QStringLiteral("--config-file=") + configFile.fileName(), QStringLiteral("--nofork"),
@@ -65,12 +66,4 @@ PrivateBus::~PrivateBus()
         m_daemon.kill();
     m_daemon.waitForFinished(5000);
     m_hadPreviousAddress ? qputenv(addressVariable, m_previousAddress) : qunsetenv(addressVariable);
-}
-
-bool PrivateBus::openToOtherUsers()
-{
-    // Traverse only: others reach the socket by name but cannot list or change the directory.
-    return QFile::setPermissions(m_dir.path(),
-        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner | QFileDevice::ExeGroup
-            | QFileDevice::ExeOther);
 }

@@ -1,3 +1,4 @@
+#include "cache-common.h"
 #include "common.h"
 #include "loopbackpeer.h"
 #include "syslogcapture.h"
@@ -6,9 +7,11 @@
 #include <QCoreApplication>
 #include <QFile>
 #include <QProcess>
+#include <QTemporaryFile>
 #include <QTest>
 
 #include <cstdio>
+#include <dlfcn.h>
 #include <unistd.h>
 
 namespace
@@ -23,11 +26,16 @@ void probeIfAsked()
     _exit(0);
 }
 Q_CONSTRUCTOR_FUNCTION(probeIfAsked)
+
+void setEnv(const char *name, const QByteArray &value)
+{
+    value.isNull() ? qunsetenv(name) : qputenv(name, value);
+}
 } // namespace
 
-// The library as the modules use it: what a caller of a given name is shown, where the daemon is found, and
-// how it is asked.
-class QueryClientTest : public QObject
+// The library as the modules use it: what a caller of a given name is shown, where the daemon is found, how it
+// is asked, how it logs and how it loads the machine's name-service libraries.
+class CCommonTest : public QObject
 {
     Q_OBJECT
 
@@ -110,26 +118,21 @@ private Q_SLOTS:
         sleeper.waitForFinished();
     }
 
+    // Every failure is one error in the log; the reply comes without its frame.
     void query_data()
     {
         QTest::addColumn<bool>("pidFile");
         QTest::addColumn<QByteArray>("answer"); // null: nobody listens
-        QTest::addColumn<QByteArray>("result"); // the reply body, or the expected log text on failure
-        QTest::newRow("reply is unframed") << true << QByteArray("\0\0\0\5hello", 9) << QByteArray("hello");
-        QTest::newRow("no pid file") << false << QByteArray()
-                                     << QByteArray(", 297, socket_query, read port failed, code: ");
-        QTest::newRow("nothing listening")
-            << true << QByteArray()
-            << QByteArray(", 303, socket_query, connect socket failed, code: 111, detail: Connection refused");
-        QTest::newRow("closed without reply")
-            << true << QByteArray("") << QByteArray(", 319, socket_query, receive message failed, code: ");
+        QTest::newRow("reply is unframed") << true << QByteArray("\0\0\0\5hello", 9);
+        QTest::newRow("no pid file") << false << QByteArray();
+        QTest::newRow("nothing listening") << true << QByteArray();
+        QTest::newRow("closed without reply") << true << QByteArray("");
     }
 
     void query()
     {
         QFETCH(bool, pidFile);
         QFETCH(QByteArray, answer);
-        QFETCH(QByteArray, result);
         TestRoot root;
         LoopbackPeer peer(answer.isNull() ? QList<QByteArray>() : QList<QByteArray> { answer });
         if (answer.isNull())
@@ -143,17 +146,105 @@ private Q_SLOTS:
         QCOMPARE(socket_query(request.constData(), size_t(request.size()),
                      reinterpret_cast<unsigned char *>(reply.data()), size_t(reply.size())),
             success ? 1 : 0);
-        if (success) {
-            QCOMPARE(reply, result + QByteArray(reply.size() - result.size(), '\0'));
-            QVERIFY(SyslogCapture::lines().isEmpty());
-            return;
+        if (success)
+            QCOMPARE(reply, "hello" + QByteArray(reply.size() - 5, '\0'));
+        QCOMPARE(SyslogCapture::lines().size(), success ? 0 : 1);
+        QCOMPARE(SyslogCapture::lines().value(0).priority, success ? 0 : 3);
+    }
+
+    // An empty suffix falls back to the versioned name as a missing one does; a given one is taken as it is.
+    void nssLibrary()
+    {
+        nss_function_entry table[NSS_FUNCTION_COUNT] = {};
+        for (const char *suffix : { "", ".2" }) {
+            void *handle = load_nss_library("files", suffix, table);
+            QVERIFY2(handle, suffix);
+            dlclose(handle);
         }
-        QCOMPARE(SyslogCapture::lines().size(), 1);
-        QCOMPARE(SyslogCapture::lines().first().priority, 3);
-        QVERIFY2(SyslogCapture::lines().first().text.contains(", src/c-common/common" + result),
-            SyslogCapture::lines().first().text);
+        // Calls through the table are the group list test's; it never uses these entries.
+        QCOMPARE(QByteArray(table[NSS_GETSGENT_R].name), QByteArray("_nss_files_getsgent_r"));
+        QCOMPARE(QByteArray(table[NSS_INITGROUPS_DYN].pattern), QByteArray("_nss_%s_initgroups_dyn"));
+        QVERIFY(SyslogCapture::lines().isEmpty());
+        QVERIFY(!load_nss_library("files", ".7", table));
+        QVERIFY(!load_nss_library("kestnone", nullptr, table));
+        QCOMPARE(SyslogCapture::lines().size(), 2);
+    }
+
+    // One message at each level, with and without USER: the streams it reaches and its whole line.
+    void logged_data()
+    {
+        QTest::addColumn<int>("level");
+        QTest::addColumn<QByteArray>("logLevel"); // KEST_IAM_LOGLEVEL; null: unset
+        QTest::addColumn<QByteArray>("user"); // null: unset
+        QTest::addColumn<QByteArray>("sinks");
+        const QByteArray alice("alice"), unset;
+        QTest::newRow("error") << 3 << unset << alice << QByteArray("syslog stderr");
+        QTest::newRow("warning, without USER") << 4 << unset << unset << QByteArray("syslog stderr");
+        QTest::newRow("notice") << 5 << unset << alice << QByteArray("syslog");
+        QTest::newRow("trace, variable unset") << 9 << unset << alice << QByteArray();
+        QTest::newRow("trace, variable empty") << 8 << QByteArray("") << alice << QByteArray();
+        QTest::newRow("trace, variable 0") << 9 << QByteArray("0") << unset << QByteArray("syslog stdout");
+    }
+
+    void logged()
+    {
+        QFETCH(int, level);
+        QFETCH(QByteArray, logLevel);
+        QFETCH(QByteArray, user);
+        QFETCH(QByteArray, sinks);
+        setEnv("USER", user);
+        setEnv("KEST_IAM_LOGLEVEL", logLevel);
+        // A body that printf would take for conversions once it were used as a format.
+        // stderr and stdout sent to files meanwhile.
+        QTemporaryFile files[2];
+        int saved[2];
+        for (int i = 0; i < 2; ++i) {
+            files[i].open();
+            saved[i] = dup(2 - i);
+            dup2(files[i].handle(), 2 - i);
+        }
+        log_message(level, "src/c-common/common", 273, "is_connect", "%d%% %s", 100, "%n sure");
+        fflush(nullptr);
+        QByteArrayList streams;
+        for (int i = 0; i < 2; ++i) {
+            dup2(saved[i], 2 - i);
+            close(saved[i]);
+            files[i].seek(0);
+            streams << files[i].readAll();
+        }
+        const QList<SyslogLine> lines = SyslogCapture::lines();
+        QCOMPARE(lines.size(), sinks.contains("syslog") ? 1 : 0);
+        const QByteArray line = lines.isEmpty() ? QByteArray() : lines.first().text;
+        QCOMPARE(streams,
+            QByteArrayList(
+                { sinks.contains("stderr") ? line + '\n' : "", sinks.contains("stdout") ? line + '\n' : "" }));
+        if (lines.isEmpty())
+            return;
+        QCOMPARE(lines.first().priority, level);
+        QVERIFY2(QRegExp(QStringLiteral("\\d{4}-\\d\\d-\\d\\d \\d\\d:\\d\\d:\\d\\d"))
+                     .exactMatch(QString::fromLatin1(line.left(19))),
+            line);
+        // Without USER the ids stand alone, and the line ends in two spaces.
+        const QByteArray ids = QString::asprintf("%u,%u, %u,%u", getuid(), geteuid(), getgid(), getegid()).toLatin1();
+        QCOMPARE(line.mid(19),
+            " process: test_ccommon(" + QByteArray::number(getpid())
+                + "), user: " + (user.isNull() ? ids + ", " : user + '(' + ids + "), ")
+                + "src/c-common/common, 273, is_connect, 100% %n sure " + (user.isNull() ? " " : ""));
+    }
+
+    void nullArgumentsAndLimits()
+    {
+        log_message(3, nullptr, 1, "function", "text");
+        log_message(3, "file", 1, nullptr, "text");
+        log_message(3, "file", 1, "function", nullptr);
+        QVERIFY(SyslogCapture::lines().isEmpty());
+
+        const QByteArray body(20000, 'a');
+        log_message(6, "file", 1, "function", "%s", body.constData());
+        QVERIFY(SyslogCapture::lines().first().text.contains(QByteArray(8189, 'a') + ' '));
+        QVERIFY(!SyslogCapture::lines().first().text.contains(QByteArray(8190, 'a')));
     }
 };
 
-QTEST_GUILESS_MAIN(QueryClientTest)
-#include "test_queryclient.moc"
+QTEST_GUILESS_MAIN(CCommonTest)
+#include "test_ccommon.moc"
