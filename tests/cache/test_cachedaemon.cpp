@@ -37,11 +37,6 @@ QByteArray command(int number, const QJsonValue &data)
         .toJson(QJsonDocument::Compact);
 }
 
-QByteArray lookUpCall(const char *name)
-{
-    return CacheDaemonFixture::functionCall(QStringLiteral("queryAccountName"), { QLatin1String(name) });
-}
-
 // A daemon in a fresh root beside a running domain server; offline login allowed for a day.
 struct Setup {
     TestRoot root;
@@ -56,7 +51,10 @@ struct Setup {
                 { QStringLiteral("offline_login/cache_validity"), 1 } }))
             && daemon.start();
     }
-    QByteArray lookUp(const char *name) const { return daemon.request(lookUpCall(name)); }
+    QByteArray lookUp(const char *name) const
+    {
+        return daemon.call(QStringLiteral("queryAccountName"), { QLatin1String(name) });
+    }
     QByteArray login(const char *name, const char *password) const
     {
         return daemon.call(QStringLiteral("authenticatePassword"), { QLatin1String(name), QLatin1String(password) });
@@ -297,7 +295,9 @@ private Q_SLOTS:
                 result("[PasswordConfig] : pw-config json parse error!!!") }));
         const QByteArray denied = result("permission denied !!!");
         QCOMPARE((Replies { asNobody(command(2, QStringLiteral(R"({"whitelist":[]})"))),
-                     asNobody(command(4, QStringLiteral("{}"))), asNobody(lookUpCall("@alice")) }),
+                     asNobody(command(4, QStringLiteral("{}"))),
+                     asNobody(CacheDaemonFixture::functionCall(
+                         QStringLiteral("queryAccountName"), { QStringLiteral("@alice") })) }),
             (Replies { denied, denied, passTrue }));
 
         QCOMPARE(s->run("--show-cache", "10001"),

@@ -17,7 +17,6 @@
 
 #include <algorithm>
 #include <grp.h>
-#include <utility>
 
 namespace
 {

@@ -10,7 +10,7 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
-    FuzzRoot::instance();
+    fuzzRoot();
     if (size < 1)
         return 0;
     // The first byte cuts the rest into the pieces the network would deliver.

@@ -4,7 +4,7 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
-    if (!FuzzRoot::instance().writeFile(QStringLiteral("/var/lib/libkest-iam/groups.txt"), fuzzInput(data, size)))
+    if (!fuzzRoot().writeFile(QStringLiteral("/var/lib/libkest-iam/groups.txt"), fuzzInput(data, size)))
         return 0;
     GroupListManager groups;
     groups.groupsOfUser(QStringLiteral("@alice"));

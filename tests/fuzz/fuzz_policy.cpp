@@ -7,7 +7,7 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size)
 {
-    const QString path = FuzzRoot::instance().path(QStringLiteral("/etc/kest-iam.conf"));
+    const QString path = fuzzRoot().filePath(QStringLiteral("/etc/kest-iam.conf"));
     QFile::remove(path);
     {
         QSettings settings(path, QSettings::IniFormat);

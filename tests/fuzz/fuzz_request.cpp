@@ -27,7 +27,7 @@ struct Daemon {
         QCoreApplication::processEvents();
     }
     // First, so that the service starts inside the private root.
-    const FuzzRoot &root = FuzzRoot::instance();
+    const TestRoot &root = fuzzRoot();
     QCoreApplication application { argc, argv };
     KestCacheLocalServer server { new KestCacheService };
     QTcpSocket client;

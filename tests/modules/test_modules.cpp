@@ -5,7 +5,6 @@
 #include "testroot.h"
 
 #include <QJsonDocument>
-#include <QJsonObject>
 #include <QProcess>
 #include <QTest>
 

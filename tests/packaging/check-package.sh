@@ -117,17 +117,13 @@ nss_edits() {
 }
 mkdir "$work/nsswitch"
 cd "$work/nsswitch"
-printf '%s\n' '# /etc/nsswitch.conf' '#' '# Example configuration of GNU Name Service Switch functionality.' '' \
-    'passwd:         files systemd' 'group:          files systemd' 'shadow:         files systemd' '' \
-    'hosts:          files dns' >default
-sed -e 's/^\(passwd\|group\)\(.*\)$/\1\2 kest/' default >default.added
 printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap\t# directory after the local files' \
     'group:  files [NOTFOUND=continue] sss kestrel' 'shadow: files ldap' 'initgroups: files' >others
 printf '%s\n' '#passwd: files' $'passwd:\tcompat ldap kest\t# directory after the local files' \
     'group:  files [NOTFOUND=continue] sss kestrel kest' 'shadow: files ldap' 'initgroups: files' >others.added
 printf '%s\n' 'passwd: files kest systemd # listed by hand' 'group:kest files' 'shadow: files kest' >listed
 printf '%s\n' 'passwd: files systemd # listed by hand' 'group: files' 'shadow: files kest' >listed.removed
-for sample in "default default.added default" "others others.added others" "listed listed listed.removed"; do
+for sample in "others others.added others" "listed listed listed.removed"; do
     check "nsswitch.conf sample ${sample%% *}: install, reinstall and remove" nss_edits $sample
 done
 
