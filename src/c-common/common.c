@@ -28,6 +28,9 @@
 #define LINE_SIZE 32767
 #define CMDLINE_READ_SIZE 256
 #define PID_TEXT_SIZE 64
+#define PID_FILE_CHUNK 512
+/* Room for an account entry, so that a look-up takes its reply in one receive. */
+#define FIRST_RECEIVE_SIZE 2048
 #define QUERY_TIMEOUT_SECONDS 5
 #define PATH_MAX_TEXT 4096
 
@@ -169,30 +172,52 @@ int pid_file_exists(void)
     return info.st_size > 0 ? 1 : 0;
 }
 
+/* Ends the line taken so far: the first one is the pid, each of two or more characters the port. */
+static void take_pid_line(char *line, size_t *length, int *first, char *pid, char *port)
+{
+    line[*length] = '\0';
+    if (*first)
+        memcpy(pid, line, PID_TEXT_SIZE);
+    if (strlen(line) >= 2)
+        memcpy(port, line, PID_TEXT_SIZE);
+    *first = 0;
+    *length = 0;
+}
+
 /* The pid file read once: its first line (the pid) and its last line of two or more characters (the
- * port), each without line ends; either may come back empty. 0 when the file cannot be read. */
+ * port), each without line ends; either may come back empty. Lines are cut at 63 characters, as a
+ * 64-byte line buffer would cut them. 0 when the file cannot be read. */
 static int read_pid_lines(char *pid, char *port)
 {
     char path[PATH_MAX_TEXT];
     if (!cache_pid_path(path, sizeof(path)))
         return 0;
-    FILE *file = fopen(path, "re");
-    if (file == NULL)
+    int fd = open(path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0)
         return 0;
     memset(pid, 0, PID_TEXT_SIZE);
     memset(port, 0, PID_TEXT_SIZE);
+    char chunk[PID_FILE_CHUNK];
     char line[PID_TEXT_SIZE];
-    for (int first = 1; fgets(line, PID_TEXT_SIZE, file) != NULL; first = 0) {
-        if (first)
-            memcpy(pid, line, PID_TEXT_SIZE);
-        if (strlen(line) >= 2)
-            memcpy(port, line, PID_TEXT_SIZE);
-    }
-    fclose(file);
+    size_t length = 0;
+    int first = 1;
+    ssize_t got;
+    do {
+        got = read(fd, chunk, sizeof(chunk));
+        for (ssize_t i = 0; i < got; ++i) {
+            line[length++] = chunk[i];
+            if (chunk[i] == '\n' || length == PID_TEXT_SIZE - 1)
+                take_pid_line(line, &length, &first, pid, port);
+        }
+        /* A regular file reads short only at its end. */
+    } while (got == (ssize_t)sizeof(chunk) || (got < 0 && errno == EINTR));
+    close(fd);
+    if (length > 0)
+        take_pid_line(line, &length, &first, pid, port);
     for (char *text = pid; text != NULL; text = text == pid ? port : NULL) {
-        size_t length = strlen(text);
-        while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
-            text[--length] = '\0';
+        size_t end = strlen(text);
+        while (end > 0 && (text[end - 1] == '\n' || text[end - 1] == '\r'))
+            text[--end] = '\0';
     }
     return 1;
 }
@@ -211,9 +236,6 @@ static int is_cache_daemon_pid(const char *pid)
     char buffer[CMDLINE_READ_SIZE];
     memset(buffer, 0, sizeof(buffer));
     snprintf(buffer, sizeof(buffer), "/proc/%s/cmdline", pid);
-    struct stat info;
-    if (lstat(buffer, &info) != 0)
-        return 0;
     int fd = open(buffer, O_RDONLY | O_CLOEXEC);
     if (fd < 0)
         return 0;
@@ -234,7 +256,10 @@ int is_cache_daemon_running(void)
     /* Without a pid "/proc//cmdline" would name the kernel's command line. */
     if (!read_pid_file(pid))
         return 0;
-    return is_cache_daemon_pid(pid);
+    char path[CMDLINE_READ_SIZE];
+    snprintf(path, sizeof(path), "/proc/%s/cmdline", pid);
+    struct stat info;
+    return lstat(path, &info) == 0 && is_cache_daemon_pid(pid);
 }
 
 static int parse_port(const char *text, unsigned short *port)
@@ -295,8 +320,8 @@ static int fail_connection(const char *function, int socket, int line, const cha
     return -1;
 }
 
-/* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
-static int send_query(const char *function, unsigned short port, const void *request, size_t request_length)
+/* Connects to the daemon; the socket, or -1 after one log line. */
+static int connect_daemon(const char *function, unsigned short port)
 {
     int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
@@ -312,6 +337,15 @@ static int send_query(const char *function, unsigned short port, const void *req
 
     if (connect(fd, (struct sockaddr *)&address, sizeof(address)) != 0)
         return fail_connection(function, fd, 303, "connect socket failed, code: %d, detail: %s");
+    return fd;
+}
+
+/* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
+static int send_query(const char *function, unsigned short port, const void *request, size_t request_length)
+{
+    int fd = connect_daemon(function, port);
+    if (fd < 0)
+        return -1;
     if (!is_connect(fd)) {
         close(fd);
         return -1;
@@ -362,70 +396,103 @@ static long milliseconds_until(const struct timespec *deadline)
     return (deadline->tv_sec - now.tv_sec) * 1000 + (deadline->tv_nsec - now.tv_nsec) / 1000000;
 }
 
-/* Fills buffer with exactly length bytes, or fails with errno set once the deadline has passed. */
-static int receive_all(int fd, unsigned char *buffer, size_t length, const struct timespec *deadline)
+/* Waits until the socket is ready for events, or fails with errno set once the deadline has passed. */
+static int wait_for(int fd, short events, const struct timespec *deadline)
 {
-    size_t got = 0;
-    while (got < length) {
+    for (;;) {
         long wait = milliseconds_until(deadline);
         if (wait <= 0) {
             errno = ETIMEDOUT;
             return 0;
         }
-        struct pollfd ready = { fd, POLLIN, 0 };
+        struct pollfd ready = { fd, events, 0 };
         int polled = poll(&ready, 1, (int)wait);
+        if (polled > 0)
+            return 1;
         if (polled < 0 && errno != EINTR)
             return 0;
-        if (polled <= 0)
-            continue;
-        ssize_t received = recv(fd, buffer + got, length - got, MSG_DONTWAIT);
-        if (received == 0) {
-            errno = ECONNRESET;
+    }
+}
+
+/* The whole request, or 0 with errno set; a send cut short would leave the daemon waiting on half a frame. */
+static int send_all(int fd, const char *request, size_t length, const struct timespec *deadline)
+{
+    for (size_t sent = 0; sent < length;) {
+        ssize_t now = send(fd, request + sent, length - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+        if (now > 0)
+            sent += (size_t)now;
+        else if (now < 0 && errno == EAGAIN && !wait_for(fd, POLLOUT, deadline))
             return 0;
-        }
-        if (received < 0 && errno != EINTR && errno != EAGAIN)
+        else if (now < 0 && errno != EAGAIN && errno != EINTR)
             return 0;
-        if (received > 0)
-            got += (size_t)received;
     }
     return 1;
+}
+
+static char *drop_frame(unsigned char *frame, int code)
+{
+    free(frame);
+    errno = code;
+    return NULL;
+}
+
+/* One frame's body, NUL-terminated, or NULL with errno set. A short reply is taken in one receive. */
+static char *receive_frame(int fd, size_t max_length, const struct timespec *deadline)
+{
+    size_t capacity = FIRST_RECEIVE_SIZE, got = 0, needed = 4;
+    unsigned char *frame = malloc(capacity + 1);
+    if (frame == NULL)
+        return drop_frame(frame, ENOMEM);
+    while (got < needed) {
+        if (!wait_for(fd, POLLIN, deadline))
+            return drop_frame(frame, errno);
+        ssize_t received = recv(fd, frame + got, capacity - got, MSG_DONTWAIT);
+        if (received == 0)
+            return drop_frame(frame, ECONNRESET);
+        if (received < 0 && errno != EINTR && errno != EAGAIN)
+            return drop_frame(frame, errno);
+        got += received > 0 ? (size_t)received : 0;
+        if (needed > 4 || got < 4)
+            continue;
+        uint32_t prefix;
+        memcpy(&prefix, frame, sizeof(prefix));
+        if (ntohl(prefix) > max_length)
+            return drop_frame(frame, EMSGSIZE);
+        needed = 4 + (size_t)ntohl(prefix);
+        if (needed <= capacity)
+            continue;
+        unsigned char *larger = realloc(frame, needed + 1);
+        if (larger == NULL)
+            return drop_frame(frame, ENOMEM);
+        frame = larger;
+        capacity = needed;
+    }
+    memmove(frame, frame + 4, needed - 4);
+    frame[needed - 4] = '\0';
+    return (char *)frame;
 }
 
 int socket_query_frame(unsigned short port, const void *request, size_t request_length, char **reply, size_t max_length)
 {
     static const char function[] = "socket_query_frame";
-    static const char failed[] = "receive message failed, code: %d, detail: %s";
     if (reply == NULL)
         return 0;
     *reply = NULL;
-    int fd = send_query(function, port, request, request_length);
+    int fd = connect_daemon(function, port);
     if (fd < 0)
         return 0;
-
-    /* However many segments the reply takes, all of it must come within one receive time-out. */
+    /* However many segments the exchange takes, each way must be done within one time-out. */
     struct timespec deadline;
     clock_gettime(CLOCK_MONOTONIC, &deadline);
     deadline.tv_sec += QUERY_TIMEOUT_SECONDS;
-    uint32_t prefix;
-    if (!receive_all(fd, (unsigned char *)&prefix, sizeof(prefix), &deadline))
-        return fail_query(function, fd, __LINE__, failed);
-    size_t length = ntohl(prefix);
-    if (length > max_length) {
-        errno = EMSGSIZE;
-        return fail_query(function, fd, __LINE__, failed);
-    }
-    char *body = malloc(length + 1);
-    if (body == NULL)
-        return fail_query(function, fd, __LINE__, failed);
-    if (!receive_all(fd, (unsigned char *)body, length, &deadline)) {
-        int code = errno;
-        free(body);
-        errno = code;
-        return fail_query(function, fd, __LINE__, failed);
-    }
-    body[length] = '\0';
+    if (!send_all(fd, request, request_length, &deadline))
+        return fail_query(function, fd, 313, "send message failed, code: %d, detail: %s");
+    clock_gettime(CLOCK_MONOTONIC, &deadline);
+    deadline.tv_sec += QUERY_TIMEOUT_SECONDS;
+    *reply = receive_frame(fd, max_length, &deadline);
+    if (*reply == NULL)
+        return fail_query(function, fd, 319, "receive message failed, code: %d, detail: %s");
     close(fd);
-    *reply = body;
     return 1;
 }
 

@@ -1,8 +1,10 @@
 #include "kestcachelocalserver.h"
 
 #include "cachestore.h"
+#include "heldloglines.h"
 #include "kestcacheservice.h"
 #include "kestpaths.h"
+#include "localconnection.h"
 #include "passwordpolicy.h"
 #include "peeruid.h"
 #include "settingsfile.h"
@@ -12,31 +14,35 @@
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QSettings>
-#include <QTcpSocket>
-#include <QTimer>
 #include <QtEndian>
 
+#include <cerrno>
+#include <cstring>
+
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <sys/socket.h>
 
 namespace
 {
 const int errorReplyVersion = 16777216;
-const char partialTimerProperty[] = "kestPartialFrameTimer";
 
 struct FunctionSpec {
     const char *name;
     int argumentCount;
+    // The service writes its own replies compact; only a password change passes on the server's text.
+    bool compactResult;
 };
 const FunctionSpec functions[] = {
-    { "queryAccountName", 1 },
-    { "queryUid", 1 },
-    { "queryGroupName", 2 },
-    { "queryGid", 2 },
-    { "authenticatePassword", 2 },
-    { "modifyUser", 1 },
-    { "getAccountByName", 1 },
-    { "getAccountByUid", 1 },
-    { "listAccounts", 0 },
+    { "queryAccountName", 1, true },
+    { "queryUid", 1, true },
+    { "queryGroupName", 2, true },
+    { "queryGid", 2, true },
+    { "authenticatePassword", 2, true },
+    { "modifyUser", 1, false },
+    { "getAccountByName", 1, true },
+    { "getAccountByUid", 1, true },
+    { "listAccounts", 0, true },
 };
 
 QString compact(const QJsonObject &object)
@@ -62,11 +68,30 @@ QByteArray KestCacheLocalServer::frame(const QByteArray &payload)
     return framed + payload;
 }
 
+bool KestCacheLocalServer::acceptOnceDataArrives()
+{
+    // Beyond this a silent client is handed over anyway, as without the option.
+    const int seconds = 5;
+    if (setsockopt(int(socketDescriptor()), IPPROTO_TCP, TCP_DEFER_ACCEPT, &seconds, sizeof(seconds)) == 0)
+        return true;
+    qWarning().noquote() << QStringLiteral("cannot defer accepting connections: ")
+            + QString::fromLocal8Bit(strerror(errno));
+    return false;
+}
+
+void KestCacheLocalServer::incomingConnection(qintptr descriptor)
+{
+    m_pending.append(new LocalConnection(int(descriptor), this));
+}
+
 void KestCacheLocalServer::onNewConnection()
 {
-    while (QTcpSocket *socket = nextPendingConnection()) {
-        connect(socket, &QTcpSocket::readyRead, this, &KestCacheLocalServer::onReadyRead);
-        connect(socket, &QTcpSocket::disconnected, this, &KestCacheLocalServer::onDisconnected);
+    while (!m_pending.isEmpty()) {
+        LocalConnection *socket = m_pending.takeFirst();
+        connect(socket, &LocalConnection::readyRead, this, &KestCacheLocalServer::onReadyRead);
+        connect(socket, &LocalConnection::disconnected, this, &KestCacheLocalServer::onDisconnected);
+        // A client sends its request right after connecting: it is usually here already.
+        socket->receive();
     }
 }
 
@@ -77,7 +102,7 @@ void KestCacheLocalServer::onAcceptError(QAbstractSocket::SocketError error)
 
 void KestCacheLocalServer::onDisconnected()
 {
-    if (auto *socket = qobject_cast<QTcpSocket *>(sender()))
+    if (auto *socket = qobject_cast<LocalConnection *>(sender()))
         socket->deleteLater();
 }
 
@@ -85,12 +110,12 @@ void KestCacheLocalServer::onDisconnected()
 // socket is deleted while one is answered: requests are served one at a time, in the order read.
 void KestCacheLocalServer::onReadyRead()
 {
-    auto *socket = qobject_cast<QTcpSocket *>(sender());
+    auto *socket = qobject_cast<LocalConnection *>(sender());
     if (!socket)
         return;
     // Strictly more than the length prefix: an empty frame waits for further bytes.
     if (socket->bytesAvailable() <= 4) {
-        watchPartialFrame(socket);
+        socket->watchPendingBytes(partialFrameTimeoutMs);
         return;
     }
     const QByteArray prefix = socket->peek(4);
@@ -101,39 +126,18 @@ void KestCacheLocalServer::onReadyRead()
         return;
     }
     if (quint64(length) + 4 > quint64(socket->bytesAvailable())) {
-        watchPartialFrame(socket);
+        socket->watchPendingBytes(partialFrameTimeoutMs);
         return;
     }
     socket->read(4);
     const QByteArray payload = socket->read(length);
     handleRequest(socket, payload);
-    watchPartialFrame(socket);
+    socket->watchPendingBytes(partialFrameTimeoutMs);
 }
 
-void KestCacheLocalServer::watchPartialFrame(QTcpSocket *socket)
+void KestCacheLocalServer::handleRequest(LocalConnection *socket, const QByteArray &payload)
 {
-    auto *timer = socket->property(partialTimerProperty).value<QTimer *>();
-    if (socket->bytesAvailable() == 0) {
-        if (timer)
-            timer->stop();
-        return;
-    }
-    if (!timer) {
-        timer = new QTimer(socket);
-        timer->setSingleShot(true);
-        timer->setInterval(partialFrameTimeoutMs);
-        connect(timer, &QTimer::timeout, socket, [socket]() {
-            if (socket->bytesAvailable() > 0)
-                socket->abort();
-        });
-        socket->setProperty(partialTimerProperty, QVariant::fromValue(timer));
-    }
-    if (!timer->isActive())
-        timer->start();
-}
-
-void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &payload)
-{
+    const HeldLogLines logAfterReply;
     const SettingsFile::OneLook settingsOnce;
     QJsonParseError error;
     const QJsonDocument document = QJsonDocument::fromJson(payload, &error);
@@ -150,37 +154,31 @@ void KestCacheLocalServer::handleRequest(QTcpSocket *socket, const QByteArray &p
 }
 
 // The service may have waited on the domain server long enough for the peer to give up.
-void KestCacheLocalServer::writeReply(QTcpSocket *socket, const QByteArray &framed)
+void KestCacheLocalServer::writeReply(LocalConnection *socket, const QByteArray &framed)
 {
-    char byte;
-    const bool peerLeft = socket->state() != QAbstractSocket::ConnectedState
-        || recv(int(socket->socketDescriptor()), &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0;
-    if (peerLeft) {
-        const QString reason = socket->error() == QAbstractSocket::UnknownSocketError
-            ? QStringLiteral("The remote host closed the connection")
-            : socket->errorString();
+    if (socket->peerHasLeft()) {
+        const QString reason = socket->errorString().isEmpty() ? QStringLiteral("The remote host closed the connection")
+                                                               : socket->errorString();
         qWarning().noquote() << QStringLiteral("socket error: ") + reason;
         return;
     }
     socket->write(framed);
-    // Out now: the client is waiting, and the event loop would send it only on its next turn.
-    socket->flush();
 }
 
-void KestCacheLocalServer::sendErrorReply(QTcpSocket *socket, const QString &text)
+void KestCacheLocalServer::sendErrorReply(LocalConnection *socket, const QString &text)
 {
     const QJsonObject reply { { QStringLiteral("version"), errorReplyVersion }, { QStringLiteral("errorInfo"), text } };
     socket->write(frame(QJsonDocument(reply).toJson(QJsonDocument::Compact)));
 }
 
-QString KestCacheLocalServer::sendResultReply(QTcpSocket *socket, int retVal, const QString &text)
+QString KestCacheLocalServer::sendResultReply(LocalConnection *socket, int retVal, const QString &text)
 {
     const QString reply = compact({ { QStringLiteral("retVal"), retVal }, { QStringLiteral("errorMessage"), text } });
     socket->write(frame(reply.toUtf8()));
     return reply;
 }
 
-QString KestCacheLocalServer::sendStatusReply(QTcpSocket *socket, int code, const QString &text)
+QString KestCacheLocalServer::sendStatusReply(LocalConnection *socket, int code, const QString &text)
 {
     const QString reply = compact({ { QStringLiteral("code"), code }, { QStringLiteral("msg"), text },
         { QStringLiteral("data"), QJsonValue::Null } });
@@ -188,7 +186,7 @@ QString KestCacheLocalServer::sendStatusReply(QTcpSocket *socket, int code, cons
     return reply;
 }
 
-QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJsonObject &request)
+QString KestCacheLocalServer::dispatchFunctionCall(LocalConnection *socket, const QJsonObject &request)
 {
     if (!request.contains(QLatin1String("functionName")) || !request.contains(QLatin1String("argv"))
         || !request.contains(QLatin1String("version"))) {
@@ -209,7 +207,9 @@ QString KestCacheLocalServer::dispatchFunctionCall(QTcpSocket *socket, const QJs
         for (const QJsonValue &argument : argv)
             arguments.append(argument.toString());
         const QString result = callService(name, arguments);
-        const QByteArray payload = QJsonDocument::fromJson(result.toUtf8()).toJson(QJsonDocument::Compact);
+        const QByteArray payload = function.compactResult
+            ? result.toUtf8()
+            : QJsonDocument::fromJson(result.toUtf8()).toJson(QJsonDocument::Compact);
         writeReply(socket, frame(payload));
         return result;
     }
@@ -240,7 +240,7 @@ QString KestCacheLocalServer::callService(const QString &name, const QStringList
     return QString();
 }
 
-void KestCacheLocalServer::handleServerCommand(QTcpSocket *socket, const QJsonObject &request)
+void KestCacheLocalServer::handleServerCommand(LocalConnection *socket, const QJsonObject &request)
 {
     if (!request.contains(QLatin1String("command")) || !request.contains(QLatin1String("data"))) {
         sendResultReply(socket, 1, QStringLiteral("The JSON field is missing. command and data are required !!!"));
@@ -277,7 +277,7 @@ void KestCacheLocalServer::handleServerCommand(QTcpSocket *socket, const QJsonOb
 }
 
 // Deleting caches and rewriting the policy are root's alone; whoever cannot be identified is refused.
-bool KestCacheLocalServer::isRootPeer(QTcpSocket *socket, int command)
+bool KestCacheLocalServer::isRootPeer(LocalConnection *socket, int command)
 {
     uid_t uid = 0;
     const bool known
@@ -290,7 +290,7 @@ bool KestCacheLocalServer::isRootPeer(QTcpSocket *socket, int command)
     return false;
 }
 
-QString KestCacheLocalServer::cleanCache(QTcpSocket *socket, const QJsonValue &data)
+QString KestCacheLocalServer::cleanCache(LocalConnection *socket, const QJsonValue &data)
 {
     const QString path = cacheFilePathOfUid(data.toString().toUInt());
     if (!QFile::exists(path))
@@ -299,7 +299,7 @@ QString KestCacheLocalServer::cleanCache(QTcpSocket *socket, const QJsonValue &d
     return sendResultReply(socket, 0, QString());
 }
 
-QString KestCacheLocalServer::cleanCacheNotInList(QTcpSocket *socket, const QJsonValue &data)
+QString KestCacheLocalServer::cleanCacheNotInList(LocalConnection *socket, const QJsonValue &data)
 {
     QJsonParseError error;
     const QJsonDocument document = QJsonDocument::fromJson(data.toString().toUtf8(), &error);
@@ -318,7 +318,7 @@ QString KestCacheLocalServer::cleanCacheNotInList(QTcpSocket *socket, const QJso
     return sendResultReply(socket, 0, QString());
 }
 
-QString KestCacheLocalServer::updateCache(QTcpSocket *socket, const QJsonValue &data)
+QString KestCacheLocalServer::updateCache(LocalConnection *socket, const QJsonValue &data)
 {
     const quint32 uid = quint32(data.toInt());
     if (!QFile::exists(cacheFilePathOfUid(uid)))
@@ -327,7 +327,7 @@ QString KestCacheLocalServer::updateCache(QTcpSocket *socket, const QJsonValue &
     return sendResultReply(socket, 0, QString());
 }
 
-QString KestCacheLocalServer::passwordConfig(QTcpSocket *socket, const QJsonValue &data)
+QString KestCacheLocalServer::passwordConfig(LocalConnection *socket, const QJsonValue &data)
 {
     QJsonParseError error;
     const QJsonDocument document = QJsonDocument::fromJson(data.toString().toUtf8(), &error);
@@ -345,7 +345,7 @@ QString KestCacheLocalServer::passwordConfig(QTcpSocket *socket, const QJsonValu
     return sendResultReply(socket, 0, QString());
 }
 
-QString KestCacheLocalServer::modifyUserPassword(QTcpSocket *socket, const QJsonValue &data)
+QString KestCacheLocalServer::modifyUserPassword(LocalConnection *socket, const QJsonValue &data)
 {
     const QString text = data.toString();
     QJsonParseError error;

@@ -1,12 +1,13 @@
 #pragma once
 
 #include <QJsonObject>
+#include <QList>
 #include <QTcpServer>
 
 #include <memory>
 
 class KestCacheService;
-class QTcpSocket;
+class LocalConnection;
 
 // The cache daemon's request server: one length-prefixed JSON request per read, one framed reply.
 class KestCacheLocalServer : public QTcpServer
@@ -19,9 +20,16 @@ public:
     ~KestCacheLocalServer() override;
 
     static QByteArray frame(const QByteArray &payload);
+    // Once listening: the kernel hands over a connection when its first bytes are there, so that a request
+    // is answered at its accept, without a wait in the event loop between the two.
+    bool acceptOnceDataArrives();
 
     static const quint32 maximumFrameLength = 1024 * 1024;
     static const int partialFrameTimeoutMs = 30000;
+
+protected:
+    // Each connection is served on its own descriptor (LocalConnection), not through a QTcpSocket.
+    void incomingConnection(qintptr descriptor) override;
 
 private Q_SLOTS:
     void onNewConnection();
@@ -30,21 +38,21 @@ private Q_SLOTS:
     void onDisconnected();
 
 private:
-    void handleRequest(QTcpSocket *socket, const QByteArray &payload);
-    void writeReply(QTcpSocket *socket, const QByteArray &framed);
-    void watchPartialFrame(QTcpSocket *socket);
-    void sendErrorReply(QTcpSocket *socket, const QString &text);
-    QString sendResultReply(QTcpSocket *socket, int retVal, const QString &text);
-    QString sendStatusReply(QTcpSocket *socket, int code, const QString &text);
-    QString dispatchFunctionCall(QTcpSocket *socket, const QJsonObject &request);
+    void handleRequest(LocalConnection *socket, const QByteArray &payload);
+    void writeReply(LocalConnection *socket, const QByteArray &framed);
+    void sendErrorReply(LocalConnection *socket, const QString &text);
+    QString sendResultReply(LocalConnection *socket, int retVal, const QString &text);
+    QString sendStatusReply(LocalConnection *socket, int code, const QString &text);
+    QString dispatchFunctionCall(LocalConnection *socket, const QJsonObject &request);
     QString callService(const QString &name, const QStringList &arguments);
-    void handleServerCommand(QTcpSocket *socket, const QJsonObject &request);
-    bool isRootPeer(QTcpSocket *socket, int command);
-    QString cleanCache(QTcpSocket *socket, const QJsonValue &data);
-    QString cleanCacheNotInList(QTcpSocket *socket, const QJsonValue &data);
-    QString updateCache(QTcpSocket *socket, const QJsonValue &data);
-    QString passwordConfig(QTcpSocket *socket, const QJsonValue &data);
-    QString modifyUserPassword(QTcpSocket *socket, const QJsonValue &data);
+    void handleServerCommand(LocalConnection *socket, const QJsonObject &request);
+    bool isRootPeer(LocalConnection *socket, int command);
+    QString cleanCache(LocalConnection *socket, const QJsonValue &data);
+    QString cleanCacheNotInList(LocalConnection *socket, const QJsonValue &data);
+    QString updateCache(LocalConnection *socket, const QJsonValue &data);
+    QString passwordConfig(LocalConnection *socket, const QJsonValue &data);
+    QString modifyUserPassword(LocalConnection *socket, const QJsonValue &data);
 
     std::unique_ptr<KestCacheService> m_service;
+    QList<LocalConnection *> m_pending;
 };

@@ -1,6 +1,7 @@
 #include "kestcacheservice.h"
 
 #include "cachestore.h"
+#include "compactjson.h"
 #include "globalsetting.h"
 #include "grouplistmanager.h"
 #include "homedirectoryrepair.h"
@@ -10,7 +11,6 @@
 #include "userlistmanager.h"
 
 #include <QDebug>
-#include <QJsonArray>
 #include <QJsonDocument>
 #include <QThread>
 
@@ -39,23 +39,20 @@ CacheControlPtr shownAccount(uint uid)
     return record;
 }
 
-QJsonObject accountEntry(const CacheControlInterface &record)
+// Keys in the order the document writer sorts them.
+QByteArray accountEntry(const CacheControlInterface &record)
 {
-    return { { QStringLiteral("name"), record.account() }, { QStringLiteral("uid"), qint64(record.uid()) },
-        { QStringLiteral("gid"), qint64(record.mainGid()) }, { QStringLiteral("gecos"), record.gecos() },
-        { QStringLiteral("home"), record.homePath() }, { QStringLiteral("shell"), record.loginShell() } };
-}
-
-QString compactReply(const QJsonObject &object)
-{
-    return QString::fromUtf8(QJsonDocument(object).toJson(QJsonDocument::Compact));
+    return "{\"gecos\":" + CompactJson::string(record.gecos()) + ",\"gid\":" + QByteArray::number(record.mainGid())
+        + ",\"home\":" + CompactJson::string(record.homePath()) + ",\"name\":" + CompactJson::string(record.account())
+        + ",\"shell\":" + CompactJson::string(record.loginShell()) + ",\"uid\":" + QByteArray::number(record.uid())
+        + '}';
 }
 
 QString accountReply(const CacheControlPtr &record)
 {
     if (!record)
         return KestCacheService::passReply(false);
-    return compactReply({ { QStringLiteral("pass"), true }, { QStringLiteral("user"), accountEntry(*record) } });
+    return QString::fromUtf8("{\"pass\":true,\"user\":" + accountEntry(*record) + '}');
 }
 } // namespace
 
@@ -342,15 +339,18 @@ QString KestCacheService::listAccounts()
 {
     if (!isEnabled())
         return passReply(false);
-    QJsonArray users;
+    QByteArray reply = "{\"pass\":true,\"users\":[";
     // In uid order, so that a listing reads the same each time.
     QList<quint32> uids = listCacheUids();
     std::sort(uids.begin(), uids.end());
+    bool first = true;
     for (const quint32 uid : uids) {
-        if (const CacheControlPtr record = shownAccount(uid))
-            users.append(accountEntry(*record));
+        if (const CacheControlPtr record = shownAccount(uid)) {
+            reply += (first ? "" : ",") + accountEntry(*record);
+            first = false;
+        }
     }
-    return compactReply({ { QStringLiteral("pass"), true }, { QStringLiteral("users"), users } });
+    return QString::fromUtf8(reply + "]}");
 }
 
 QString KestCacheService::changePassword(

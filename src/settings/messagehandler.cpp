@@ -1,5 +1,7 @@
 #include "messagehandler.h"
 
+#include "heldloglines.h"
+
 #include <QString>
 
 #include <ctime>
@@ -31,6 +33,12 @@ void messageHandler(QtMsgType type, const QMessageLogContext &context, const QSt
     text.replace(QStringLiteral("\\n"), QStringLiteral(" "));
     text.replace(QLatin1Char('\n'), QStringLiteral(". "));
     text.replace(QLatin1Char('\r'), QStringLiteral(". "));
+    const QByteArray line = text.toUtf8();
+    // A fatal message ends the process: it and everything before it go out now.
+    if (type == QtFatalMsg)
+        HeldLogLines::flush();
+    else if (HeldLogLines::hold(syslogPriorityOf(type), line))
+        return;
     // The text goes through "%s": a "%" in a message must never be read as a conversion.
-    syslog(syslogPriorityOf(type), "%s", text.toUtf8().constData());
+    syslog(syslogPriorityOf(type), "%s", line.constData());
 }

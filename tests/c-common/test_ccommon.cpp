@@ -139,6 +139,33 @@ private Q_SLOTS:
         QCOMPARE(SyslogCapture::lines().value(0).priority, success ? 0 : 3);
     }
 
+    // The modules' reader takes a whole frame, however long, within its limit.
+    void queryFrame_data()
+    {
+        QTest::addColumn<QByteArray>("answer");
+        QTest::addColumn<QByteArray>("body"); // null: no reply, one error logged
+        const auto frame = [](const QByteArray &body) {
+            return QByteArray::fromHex(QByteArray::number(body.size(), 16).rightJustified(8, '0')) + body;
+        };
+        const QByteArray large(100000, 'a');
+        QTest::newRow("in one receive") << frame("hello") << QByteArray("hello");
+        QTest::newRow("beyond the first receive") << frame(large) << large;
+        QTest::newRow("cut short") << QByteArray("\0\0\0\12abc", 7) << QByteArray();
+        QTest::newRow("above the limit") << frame(large + 'b') << QByteArray();
+    }
+
+    void queryFrame()
+    {
+        QFETCH(QByteArray, answer);
+        QFETCH(QByteArray, body);
+        LoopbackPeer peer({ answer });
+        char *reply = nullptr;
+        const int answered = socket_query_frame(peer.port(), "\0\0\0\2{}", 6, &reply, 100000);
+        QCOMPARE(answered ? QByteArray(reply) : QByteArray(), body);
+        free(reply);
+        QCOMPARE(SyslogCapture::lines().size(), body.isNull() ? 1 : 0);
+    }
+
     // An empty suffix falls back to the versioned name as a missing one does; a given one is taken as it is.
     void nssLibrary()
     {

@@ -1,4 +1,5 @@
 #include "cachestore.h"
+#include "compactjson.h"
 #include "domainserverfixture.h"
 #include "grouplistmanager.h"
 #include "homedirectoryrepair.h"
@@ -134,6 +135,22 @@ private Q_SLOTS:
         QCOMPARE(record->uid(), 4000000000u);
         QVERIFY(!cacheRecordFromJson(record, QStringLiteral("{\"version\": 2}")) && record.isNull());
         QCOMPARE(SyslogCapture::lines().size(), 3);
+    }
+
+    // The replies written by hand must read exactly as the document writer would write them.
+    void compactJsonString_data()
+    {
+        QTest::addColumn<QString>("text");
+        QTest::newRow("plain") << QStringLiteral("/home/@alice");
+        QTest::newRow("quotes and escapes") << QStringLiteral("a\"b\\c\b\f\n\r\t\x01\x1f\x7f/");
+        QTest::newRow("two to four UTF-8 bytes") << QString::fromUtf8("\xc3\xa9\xe4\xb8\xad\xf0\x9f\x98\x80");
+        QTest::newRow("lone surrogates") << QString(QChar(0xd83d)) + QLatin1Char('x') + QChar(0xde00);
+    }
+    void compactJsonString()
+    {
+        QFETCH(QString, text);
+        const QByteArray document = QJsonDocument(QJsonArray { text }).toJson(QJsonDocument::Compact);
+        QCOMPARE(CompactJson::string(text), document.mid(1, document.size() - 2));
     }
 
     void readFromFile_data()

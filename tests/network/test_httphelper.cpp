@@ -1,5 +1,6 @@
 #include "domainserverfixture.h"
 #include "globalsetting.h"
+#include "heldloglines.h"
 #include "httphelper.h"
 #include "messagehandler.h"
 #include "syslogcapture.h"
@@ -196,17 +197,24 @@ private Q_SLOTS:
         QTest::newRow("other is notice") << 42 << QStringLiteral("100% %s %n") << 5 << QByteArray("100% %s %n");
     }
 
-    // Called directly: through qFatal, Qt itself would end the process after the handler.
+    // Called directly: through qFatal, Qt itself would end the process after the handler. Each line comes after
+    // one that was held back with it; only a fatal one does not wait for the end of the hold.
     void messageHandlerLine()
     {
         QFETCH(int, type);
         QFETCH(QString, message);
         QFETCH(int, priority);
         QFETCH(QByteArray, logged);
-        messageHandler(QtMsgType(type), QMessageLogContext(), message);
-        QCOMPARE(SyslogCapture::lines().size(), 1);
-        QCOMPARE(SyslogCapture::lines().first().priority, priority);
-        const QByteArray line = SyslogCapture::lines().first().text;
+        {
+            const HeldLogLines held;
+            messageHandler(QtInfoMsg, QMessageLogContext(), QStringLiteral("held"));
+            messageHandler(QtMsgType(type), QMessageLogContext(), message);
+            QCOMPARE(SyslogCapture::lines().size(), type == QtFatalMsg ? 2 : 0);
+        }
+        QCOMPARE(SyslogCapture::lines().size(), 2);
+        QVERIFY(SyslogCapture::lines().first().text.endsWith(", held"));
+        QCOMPARE(SyslogCapture::lines().last().priority, priority);
+        const QByteArray line = SyslogCapture::lines().last().text;
         QVERIFY2(QRegExp(QStringLiteral("cpu time: \\d+, ") + QRegExp::escape(QString::fromUtf8(logged)))
                      .exactMatch(QString::fromUtf8(line)),
             line);

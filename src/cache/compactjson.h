@@ -1,0 +1,13 @@
+#pragma once
+
+#include <QByteArray>
+#include <QString>
+
+// JSON text of a string written directly, byte for byte what QJsonDocument writes for it: the replies
+// sent at every look-up are cheaper to write than to build as a document first.
+class CompactJson
+{
+public:
+    // The quoted and escaped text.
+    static QByteArray string(const QString &text);
+};
