@@ -4,15 +4,21 @@
 
 #include "common.h"
 #include "json-reader.h"
+#include "paths.h"
 
 #include <arpa/inet.h>
+#include <errno.h>
 #include <pthread.h>
+#include <signal.h>
 #include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/stat.h>
 
 #define SOURCE_PATH "src/modules/daemon-client"
 #define PROCESS_NAME_SIZE 64
+#define PID_TEXT_SIZE 64
+#define PATH_SIZE 4096
 #define REQUEST_SIZE 16384
 /* A listing of every cached account is the longest reply; far below this even for many thousands. */
 #define REPLY_LIMIT (64 * 1024 * 1024)
@@ -28,11 +34,63 @@ static void find_self(void)
     self_is_daemon = get_process_name(process) && strcmp(process, "cache-kest") == 0;
 }
 
+/* The daemon found last, as its pid file was when it was found. Every look-up asks for the daemon, and
+ * reading its pid file and /proc/<pid>/cmdline costs more than the look-up's whole exchange. */
+struct known_daemon {
+    dev_t device;
+    ino_t inode;
+    off_t size;
+    struct timespec changed;
+    pid_t pid;
+    unsigned short port;
+};
+static pthread_mutex_t known_lock = PTHREAD_MUTEX_INITIALIZER;
+static struct known_daemon known;
+
+static int same_file(const struct known_daemon *daemon, const struct stat *file)
+{
+    return daemon->device == file->st_dev && daemon->inode == file->st_ino && daemon->size == file->st_size
+        && daemon->changed.tv_sec == file->st_mtim.tv_sec && daemon->changed.tv_nsec == file->st_mtim.tv_nsec;
+}
+
+/* Still the daemon found before: the same pid file, and its process alive. Never waits on the lock (a
+ * child forked while another thread held it must not hang): a busy lock is a miss. */
+static unsigned short known_port(const struct stat *file)
+{
+    if (pthread_mutex_trylock(&known_lock) != 0)
+        return 0;
+    struct known_daemon daemon = known;
+    pthread_mutex_unlock(&known_lock);
+    if (daemon.port == 0 || !same_file(&daemon, file))
+        return 0;
+    return kill(daemon.pid, 0) == 0 || errno == EPERM ? daemon.port : 0;
+}
+
+static void remember(const struct stat *file, const char *pid, unsigned short port)
+{
+    struct known_daemon daemon = { file->st_dev, file->st_ino, file->st_size, file->st_mtim, (pid_t)atol(pid), port };
+    if (daemon.pid <= 0 || pthread_mutex_trylock(&known_lock) != 0)
+        return;
+    known = daemon;
+    pthread_mutex_unlock(&known_lock);
+}
+
 unsigned short kest_daemon_port(void)
 {
     pthread_once(&self_once, find_self);
-    unsigned short port = 0;
-    return !self_is_daemon && cache_daemon_port(&port) ? port : 0;
+    char path[PATH_SIZE];
+    struct stat file;
+    if (self_is_daemon || !kest_path(KEST_PATH_CACHE_PID, path, sizeof(path)) || stat(path, &file) != 0)
+        return 0;
+    unsigned short port = known_port(&file);
+    if (port != 0)
+        return port;
+    char pid[PID_TEXT_SIZE];
+    if (!cache_daemon_port(&port) || !read_pid_file(pid))
+        return 0;
+    /* Kept as the file was before it was read: had it changed since, the next look-up reads it again. */
+    remember(&file, pid, port);
+    return port;
 }
 
 static int append_raw(char *out, size_t size, size_t *length, const char *text)

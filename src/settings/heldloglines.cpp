@@ -1,15 +1,10 @@
 #include "heldloglines.h"
 
-#include <syslog.h>
+#include "messagehandler.h"
 
 namespace
 {
 thread_local HeldLogLines *holder = nullptr;
-
-void writeLine(int priority, const QByteArray &text)
-{
-    syslog(priority, "%s", text.constData());
-}
 } // namespace
 
 HeldLogLines::HeldLogLines()
@@ -27,11 +22,11 @@ HeldLogLines::~HeldLogLines()
     holder = nullptr;
 }
 
-bool HeldLogLines::hold(int priority, const QByteArray &text)
+bool HeldLogLines::hold(QtMsgType type, unsigned long ticks, const QString &message)
 {
     if (!holder)
         return false;
-    holder->m_lines.append({ priority, text });
+    holder->m_lines.append({ type, ticks, message });
     return true;
 }
 
@@ -39,7 +34,7 @@ void HeldLogLines::flush()
 {
     if (!holder)
         return;
-    for (const auto &[priority, text] : qAsConst(holder->m_lines))
-        writeLine(priority, text);
+    for (const Line &line : qAsConst(holder->m_lines))
+        writeLogLine(line.type, line.ticks, line.message);
     holder->m_lines.clear();
 }

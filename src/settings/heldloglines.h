@@ -1,8 +1,7 @@
 #pragma once
 
-#include <QByteArray>
 #include <QList>
-#include <QPair>
+#include <QString>
 
 // While one lives, the log lines of its thread are held and then written in order when it ends: the cache
 // daemon answers first and logs after, so that no client waits on the system log.
@@ -15,11 +14,16 @@ public:
     HeldLogLines &operator=(const HeldLogLines &) = delete;
 
     // False when nothing holds this thread's lines: the caller writes the line itself.
-    static bool hold(int priority, const QByteArray &text);
+    static bool hold(QtMsgType type, unsigned long ticks, const QString &message);
     // Writes what is held now, as before a line that must not wait.
     static void flush();
 
 private:
+    struct Line {
+        QtMsgType type;
+        unsigned long ticks;
+        QString message;
+    };
     bool m_outermost;
-    QList<QPair<int, QByteArray>> m_lines;
+    QList<Line> m_lines;
 };

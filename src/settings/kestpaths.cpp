@@ -2,11 +2,25 @@
 
 #include "paths.h"
 
+#include <QByteArray>
+#include <QHash>
+
 namespace
 {
+// Paths are asked for at every request; only tests ever change the root, so each joined path is kept
+// for the root text it was made with.
 QString prefixed(const char *path)
 {
-    return QString::fromLocal8Bit(kest_root()) + QString::fromLatin1(path);
+    struct Joined {
+        QByteArray root;
+        QString path;
+    };
+    thread_local QHash<const char *, Joined> joined;
+    const char *root = kest_root();
+    Joined &entry = joined[path];
+    if (entry.path.isNull() || entry.root != root)
+        entry = { root, QString::fromLocal8Bit(root) + QString::fromLatin1(path) };
+    return entry.path;
 }
 } // namespace
 

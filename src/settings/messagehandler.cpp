@@ -24,21 +24,25 @@ int syslogPriorityOf(QtMsgType type)
     return LOG_NOTICE;
 }
 
-void messageHandler(QtMsgType type, const QMessageLogContext &context, const QString &message)
+void writeLogLine(QtMsgType type, unsigned long ticks, const QString &message)
 {
-    Q_UNUSED(context)
-    const unsigned long ticks = static_cast<unsigned long>(clock());
     QString text = QStringLiteral("cpu time: ") + QString::number(ticks) + QStringLiteral(", ") + message;
     text.replace(QStringLiteral("\\\""), QString());
     text.replace(QStringLiteral("\\n"), QStringLiteral(" "));
     text.replace(QLatin1Char('\n'), QStringLiteral(". "));
     text.replace(QLatin1Char('\r'), QStringLiteral(". "));
-    const QByteArray line = text.toUtf8();
+    // The text goes through "%s": a "%" in a message must never be read as a conversion.
+    syslog(syslogPriorityOf(type), "%s", text.toUtf8().constData());
+}
+
+void messageHandler(QtMsgType type, const QMessageLogContext &context, const QString &message)
+{
+    Q_UNUSED(context)
+    const unsigned long ticks = static_cast<unsigned long>(clock());
     // A fatal message ends the process: it and everything before it go out now.
     if (type == QtFatalMsg)
         HeldLogLines::flush();
-    else if (HeldLogLines::hold(syslogPriorityOf(type), line))
+    else if (HeldLogLines::hold(type, ticks, message))
         return;
-    // The text goes through "%s": a "%" in a message must never be read as a conversion.
-    syslog(syslogPriorityOf(type), "%s", line.constData());
+    writeLogLine(type, ticks, message);
 }

@@ -129,6 +129,41 @@ private Q_SLOTS:
         QTEST(result, "result");
     }
 
+    // A daemon found once is trusted while its pid file stays the same and its process lives, no longer:
+    // after a restart the port is another, after a crash it could be anyone's.
+    void foundDaemon()
+    {
+        TestRoot root;
+        const QByteArray entry = CacheDaemonFixture::frame(
+            R"({"pass":true,"user":{"gecos":"","gid":10000,"home":"/","name":"@alice","shell":"/bin/sh","uid":10001}})");
+        LoopbackPeer first({ entry, entry }), second({ entry, entry });
+        QProcess daemon;
+        daemon.start(QStringLiteral("bash"), { QStringLiteral("-c"), QStringLiteral("exec -a cache-kest sleep 60") });
+        const QByteArray pid = QByteArray::number(daemon.processId());
+        QFile cmdline(QStringLiteral("/proc/%1/cmdline").arg(daemon.processId()));
+        QVERIFY(QTest::qWaitFor([&] {
+            const bool named = cmdline.open(QIODevice::ReadOnly) && cmdline.readAll().startsWith("cache-kest");
+            cmdline.close();
+            return named;
+        }));
+        // Port 0 leaves the pid file as it is.
+        const auto lookUp = [&](quint16 port) {
+            if (port != 0)
+                root.writeFile(QStringLiteral("/run/cache-kest.pid"), pid + '\n' + QByteArray::number(port) + '\n');
+            passwd pwd {};
+            char buffer[1024];
+            int error = 0;
+            return reinterpret_cast<nss_status (*)(const char *, passwd *, char *, size_t, int *)>(
+                dlsym(m_nss, "_nss_kest_getpwnam_r"))("@alice", &pwd, buffer, sizeof(buffer), &error);
+        };
+        QCOMPARE(lookUp(first.port()), NSS_STATUS_SUCCESS);
+        QCOMPARE(lookUp(second.port()), NSS_STATUS_SUCCESS);
+        daemon.kill();
+        daemon.waitForFinished();
+        QCOMPARE(lookUp(0), NSS_STATUS_UNAVAIL);
+        QCOMPARE(QList<int>({ first.finish().size(), second.finish().size() }), QList<int>({ 1, 1 }));
+    }
+
     void glibcAndPam_data()
     {
         // 0: all up, 1: the domain server's SYNs dropped (cache-kest restarted), 2: cache-kest stopped
