@@ -16,13 +16,6 @@
 #include <QSettings>
 #include <QtEndian>
 
-#include <cerrno>
-#include <cstring>
-
-#include <netinet/in.h>
-#include <netinet/tcp.h>
-#include <sys/socket.h>
-
 namespace
 {
 const int errorReplyVersion = 16777216;
@@ -66,17 +59,6 @@ QByteArray KestCacheLocalServer::frame(const QByteArray &payload)
     QByteArray framed(4, '\0');
     qToBigEndian<quint32>(quint32(payload.size()), framed.data());
     return framed + payload;
-}
-
-bool KestCacheLocalServer::acceptOnceDataArrives()
-{
-    // Beyond this a silent client is handed over anyway, as without the option.
-    const int seconds = 5;
-    if (setsockopt(int(socketDescriptor()), IPPROTO_TCP, TCP_DEFER_ACCEPT, &seconds, sizeof(seconds)) == 0)
-        return true;
-    qWarning().noquote() << QStringLiteral("cannot defer accepting connections: ")
-            + QString::fromLocal8Bit(strerror(errno));
-    return false;
 }
 
 void KestCacheLocalServer::incomingConnection(qintptr descriptor)

@@ -20,9 +20,6 @@ public:
     ~KestCacheLocalServer() override;
 
     static QByteArray frame(const QByteArray &payload);
-    // Once listening: the kernel hands over a connection when its first bytes are there, so that a request
-    // is answered at its accept, without a wait in the event loop between the two.
-    bool acceptOnceDataArrives();
 
     static const quint32 maximumFrameLength = 1024 * 1024;
     static const int partialFrameTimeoutMs = 30000;

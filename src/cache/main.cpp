@@ -53,7 +53,6 @@ int runDaemon(QCoreApplication &app)
                 + QStringLiteral(", error: ") + server.errorString();
         return 1;
     }
-    server.acceptOnceDataArrives();
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
