@@ -262,8 +262,9 @@ void KestCacheLocalServer::handleServerCommand(LocalConnection *socket, const QJ
 bool KestCacheLocalServer::isRootPeer(LocalConnection *socket, int command)
 {
     uid_t uid = 0;
-    const bool known
-        = PeerUid::lookup(socket->peerAddress(), socket->peerPort(), socket->localAddress(), socket->localPort(), uid);
+    quint16 peerPort = 0, localPort = 0;
+    const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
+    const bool known = PeerUid::lookup(peer, peerPort, local, localPort, uid);
     if (known && uid == 0)
         return true;
     const qint64 shown = known ? qint64(uid) : -1;

@@ -26,16 +26,16 @@ QString systemError(int error)
 
 using NameOf = int (*)(int, sockaddr *, socklen_t *);
 
-QHostAddress addressOf(int descriptor, NameOf nameOf, quint16 *port)
+QHostAddress addressOf(int descriptor, NameOf nameOf, quint16 &port)
 {
     sockaddr_storage address {};
     socklen_t length = sizeof(address);
     if (descriptor < 0 || nameOf(descriptor, reinterpret_cast<sockaddr *>(&address), &length) != 0)
         return QHostAddress();
-    if (port && address.ss_family == AF_INET)
-        *port = ntohs(reinterpret_cast<const sockaddr_in &>(address).sin_port);
-    if (port && address.ss_family == AF_INET6)
-        *port = ntohs(reinterpret_cast<const sockaddr_in6 &>(address).sin6_port);
+    if (address.ss_family == AF_INET)
+        port = ntohs(reinterpret_cast<const sockaddr_in &>(address).sin_port);
+    if (address.ss_family == AF_INET6)
+        port = ntohs(reinterpret_cast<const sockaddr_in6 &>(address).sin6_port);
     return QHostAddress(reinterpret_cast<const sockaddr *>(&address));
 }
 } // namespace
@@ -175,26 +175,12 @@ void LocalConnection::watchPendingBytes(int timeoutMs)
         m_pendingTimer->start(timeoutMs);
 }
 
-QHostAddress LocalConnection::peerAddress() const
+QHostAddress LocalConnection::peerAddress(quint16 &port) const
 {
-    return addressOf(m_descriptor, getpeername, nullptr);
+    return addressOf(m_descriptor, getpeername, port);
 }
 
-quint16 LocalConnection::peerPort() const
+QHostAddress LocalConnection::localAddress(quint16 &port) const
 {
-    quint16 port = 0;
-    addressOf(m_descriptor, getpeername, &port);
-    return port;
-}
-
-QHostAddress LocalConnection::localAddress() const
-{
-    return addressOf(m_descriptor, getsockname, nullptr);
-}
-
-quint16 LocalConnection::localPort() const
-{
-    quint16 port = 0;
-    addressOf(m_descriptor, getsockname, &port);
-    return port;
+    return addressOf(m_descriptor, getsockname, port);
 }

@@ -34,10 +34,9 @@ public:
     // Aborts after the time-out while unread bytes are kept, stops watching when nothing is.
     void watchPendingBytes(int timeoutMs);
 
-    QHostAddress peerAddress() const;
-    quint16 peerPort() const;
-    QHostAddress localAddress() const;
-    quint16 localPort() const;
+    // Null, and port left as it was, when the descriptor is gone.
+    QHostAddress peerAddress(quint16 &port) const;
+    QHostAddress localAddress(quint16 &port) const;
 
     // Takes what has arrived; the read notifications call it again for what follows.
     void receive();

@@ -26,7 +26,7 @@ bool HeldLogLines::hold(QtMsgType type, unsigned long ticks, const QString &mess
 {
     if (!holder)
         return false;
-    holder->m_lines.append({ type, ticks, message });
+    holder->m_lines.append({ int(type), ticks, message });
     return true;
 }
 
@@ -35,6 +35,6 @@ void HeldLogLines::flush()
     if (!holder)
         return;
     for (const Line &line : qAsConst(holder->m_lines))
-        writeLogLine(line.type, line.ticks, line.message);
+        writeLogLine(QtMsgType(line.type), line.ticks, line.message);
     holder->m_lines.clear();
 }

@@ -20,7 +20,7 @@ public:
 
 private:
     struct Line {
-        QtMsgType type;
+        int type; // as given: a message type beyond the enumeration is logged as a notice
         unsigned long ticks;
         QString message;
     };

@@ -4,6 +4,7 @@
 #include "grouplistmanager.h"
 #include "homedirectoryrepair.h"
 #include "httphelper.h"
+#include "localconnection.h"
 #include "messagehandler.h"
 #include "offlinelogin.h"
 #include "syslogcapture.h"
@@ -20,6 +21,7 @@
 #include <atomic>
 #include <dirent.h>
 #include <grp.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -151,6 +153,31 @@ private Q_SLOTS:
         QFETCH(QString, text);
         const QByteArray document = QJsonDocument(QJsonArray { text }).toJson(QJsonDocument::Compact);
         QCOMPARE(CompactJson::string(text), document.mid(1, document.size() - 2));
+    }
+
+    // What the socket does not take at once is sent as it drains, in order; the peer's leaving is seen.
+    void connectionWritesWhatDoesNotFit()
+    {
+        int pair[2];
+        QVERIFY(socketpair(AF_UNIX, SOCK_STREAM, 0, pair) == 0);
+        const int small = 4096;
+        setsockopt(pair[0], SOL_SOCKET, SO_SNDBUF, &small, sizeof(small));
+        LocalConnection connection(pair[0]);
+        QByteArray sent(128 * 1024, Qt::Uninitialized);
+        for (int i = 0; i < sent.size(); ++i)
+            sent[i] = char(i % 251);
+        connection.write(sent);
+        QByteArray received;
+        char buffer[65536];
+        QVERIFY(QTest::qWaitFor([&] {
+            for (ssize_t got; (got = recv(pair[1], buffer, sizeof(buffer), MSG_DONTWAIT)) > 0;)
+                received.append(buffer, int(got));
+            return received.size() >= sent.size();
+        }));
+        QCOMPARE(received, sent);
+        QVERIFY(!connection.peerHasLeft());
+        close(pair[1]);
+        QVERIFY(connection.peerHasLeft());
     }
 
     void readFromFile_data()
