@@ -141,8 +141,10 @@ int kest_json_object(char *out, size_t size, const char *const *pairs, size_t co
     return 1;
 }
 
-/* The whole frame: length prefix and {"version","functionName","argv"}; 0 when it does not fit. */
-static size_t build_request(char *out, size_t size, const char *function, const char *const *argv, size_t argc)
+/* The whole frame: length prefix and {"version","functionName","argv"}; 0 when it does not fit. written:
+ * how many bytes of out were written either way. */
+static size_t build_request(
+    char *out, size_t size, const char *function, const char *const *argv, size_t argc, size_t *written)
 {
     size_t length = 4;
     int fits = append_raw(out, size, &length, "{\"version\":16777216,\"functionName\":")
@@ -150,7 +152,9 @@ static size_t build_request(char *out, size_t size, const char *function, const 
     for (size_t i = 0; fits && i < argc; ++i)
         fits = (i == 0 || append_raw(out, size, &length, ","))
             && append_json_string(out, size, &length, argv[i] ? argv[i] : "");
-    if (!fits || !append_raw(out, size, &length, "]}"))
+    fits = fits && append_raw(out, size, &length, "]}");
+    *written = length;
+    if (!fits)
         return 0;
     uint32_t payload = htonl((uint32_t)(length - 4));
     memcpy(out, &payload, sizeof(payload));
@@ -163,9 +167,11 @@ int kest_call(unsigned short port, const char *function, const char *const *argv
     if (port == 0)
         return 0;
     char request[REQUEST_SIZE];
-    size_t length = build_request(request, sizeof(request), function, argv, argc);
+    size_t written = 0;
+    size_t length = build_request(request, sizeof(request), function, argv, argc, &written);
     int answered = length > 0 && socket_query_frame(port, request, length, reply, REPLY_LIMIT);
-    explicit_bzero(request, sizeof(request));
+    /* Only the bytes written can hold a password. */
+    explicit_bzero(request, written);
     if (length == 0)
         log_message(3, SOURCE_PATH, __LINE__, __func__, "request %s too long for cache-kest", function);
     return answered;
