@@ -2,85 +2,93 @@
 
 namespace
 {
-char hexDigit(uint value)
-{
-    return "0123456789abcdef"[value & 0xf];
-}
+// The longest form of one UTF-16 unit: \uXXXX.
+const int longestPerUnit = 6;
 
-void appendUnicodeEscape(QByteArray &out, uint unit)
+char *escaped(char *out, uint unit)
 {
-    out += "\\u";
+    *out++ = '\\';
+    *out++ = 'u';
     for (int shift = 12; shift >= 0; shift -= 4)
-        out += hexDigit(unit >> shift);
+        *out++ = "0123456789abcdef"[(unit >> shift) & 0xf];
+    return out;
 }
 
-void appendAscii(QByteArray &out, char16_t unit)
+char *ascii(char *out, char16_t unit)
 {
+    const char *shortForm = nullptr;
     switch (unit) {
     case u'"':
-        out += "\\\"";
-        return;
+        shortForm = "\\\"";
+        break;
     case u'\\':
-        out += "\\\\";
-        return;
+        shortForm = "\\\\";
+        break;
     case u'\b':
-        out += "\\b";
-        return;
+        shortForm = "\\b";
+        break;
     case u'\f':
-        out += "\\f";
-        return;
+        shortForm = "\\f";
+        break;
     case u'\n':
-        out += "\\n";
-        return;
+        shortForm = "\\n";
+        break;
     case u'\r':
-        out += "\\r";
-        return;
+        shortForm = "\\r";
+        break;
     case u'\t':
-        out += "\\t";
-        return;
+        shortForm = "\\t";
+        break;
+    }
+    if (shortForm) {
+        *out++ = shortForm[0];
+        *out++ = shortForm[1];
+        return out;
     }
     if (unit < 0x20)
-        appendUnicodeEscape(out, unit);
-    else
-        out += char(unit);
+        return escaped(out, unit);
+    *out++ = char(unit);
+    return out;
 }
 
-void appendUtf8(QByteArray &out, uint code)
+char *utf8(char *out, uint code)
 {
     if (code < 0x800) {
-        out += char(0xc0 | (code >> 6));
+        *out++ = char(0xc0 | (code >> 6));
     } else if (code < 0x10000) {
-        out += char(0xe0 | (code >> 12));
-        out += char(0x80 | ((code >> 6) & 0x3f));
+        *out++ = char(0xe0 | (code >> 12));
+        *out++ = char(0x80 | ((code >> 6) & 0x3f));
     } else {
-        out += char(0xf0 | (code >> 18));
-        out += char(0x80 | ((code >> 12) & 0x3f));
-        out += char(0x80 | ((code >> 6) & 0x3f));
+        *out++ = char(0xf0 | (code >> 18));
+        *out++ = char(0x80 | ((code >> 12) & 0x3f));
+        *out++ = char(0x80 | ((code >> 6) & 0x3f));
     }
-    out += char(0x80 | (code & 0x3f));
+    *out++ = char(0x80 | (code & 0x3f));
+    return out;
 }
 } // namespace
 
-QByteArray CompactJson::string(const QString &text)
+void CompactJson::append(QByteArray &out, const QString &text)
 {
-    QByteArray out;
-    out.reserve(text.size() + 2);
-    out += '"';
+    const int start = out.size();
+    out.resize(start + text.size() * longestPerUnit + 2);
+    char *cursor = out.data() + start;
+    *cursor++ = '"';
     const QChar *const end = text.constEnd();
     for (const QChar *c = text.constBegin(); c != end; ++c) {
         const char16_t unit = c->unicode();
         if (unit < 0x80) {
-            appendAscii(out, unit);
+            cursor = ascii(cursor, unit);
         } else if (c->isHighSurrogate() && c + 1 != end && c[1].isLowSurrogate()) {
-            appendUtf8(out, QChar::surrogateToUcs4(*c, c[1]));
+            cursor = utf8(cursor, QChar::surrogateToUcs4(*c, c[1]));
             ++c;
         } else if (c->isSurrogate()) {
             // A surrogate without its other half has no UTF-8 form.
-            appendUnicodeEscape(out, unit);
+            cursor = escaped(cursor, unit);
         } else {
-            appendUtf8(out, unit);
+            cursor = utf8(cursor, unit);
         }
     }
-    out += '"';
-    return out;
+    *cursor++ = '"';
+    out.resize(int(cursor - out.constData()));
 }

@@ -8,6 +8,6 @@
 class CompactJson
 {
 public:
-    // The quoted and escaped text.
-    static QByteArray string(const QString &text);
+    // Appends the quoted and escaped text.
+    static void append(QByteArray &out, const QString &text);
 };

@@ -40,19 +40,28 @@ CacheControlPtr shownAccount(uint uid)
 }
 
 // Keys in the order the document writer sorts them.
-QByteArray accountEntry(const CacheControlInterface &record)
+void appendAccountEntry(QByteArray &out, const CacheControlInterface &record)
 {
-    return "{\"gecos\":" + CompactJson::string(record.gecos()) + ",\"gid\":" + QByteArray::number(record.mainGid())
-        + ",\"home\":" + CompactJson::string(record.homePath()) + ",\"name\":" + CompactJson::string(record.account())
-        + ",\"shell\":" + CompactJson::string(record.loginShell()) + ",\"uid\":" + QByteArray::number(record.uid())
-        + '}';
+    out += "{\"gecos\":";
+    CompactJson::append(out, record.gecos());
+    out += ",\"gid\":" + QByteArray::number(record.mainGid()) + ",\"home\":";
+    CompactJson::append(out, record.homePath());
+    out += ",\"name\":";
+    CompactJson::append(out, record.account());
+    out += ",\"shell\":";
+    CompactJson::append(out, record.loginShell());
+    out += ",\"uid\":" + QByteArray::number(record.uid()) + '}';
 }
 
 QString accountReply(const CacheControlPtr &record)
 {
     if (!record)
         return KestCacheService::passReply(false);
-    return QString::fromUtf8("{\"pass\":true,\"user\":" + accountEntry(*record) + '}');
+    QByteArray reply;
+    reply.reserve(256);
+    reply += "{\"pass\":true,\"user\":";
+    appendAccountEntry(reply, *record);
+    return QString::fromUtf8(reply + '}');
 }
 } // namespace
 
@@ -346,7 +355,9 @@ QString KestCacheService::listAccounts()
     bool first = true;
     for (const quint32 uid : uids) {
         if (const CacheControlPtr record = shownAccount(uid)) {
-            reply += (first ? "" : ",") + accountEntry(*record);
+            if (!first)
+                reply += ',';
+            appendAccountEntry(reply, *record);
             first = false;
         }
     }
