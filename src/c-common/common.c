@@ -28,7 +28,6 @@
 #define LINE_SIZE 32767
 #define CMDLINE_READ_SIZE 256
 #define PID_TEXT_SIZE 64
-#define PID_FILE_CHUNK 512
 /* Room for an account entry, so that a look-up takes its reply in one receive. */
 #define FIRST_RECEIVE_SIZE 2048
 #define QUERY_TIMEOUT_SECONDS 5
@@ -172,52 +171,30 @@ int pid_file_exists(void)
     return info.st_size > 0 ? 1 : 0;
 }
 
-/* Ends the line taken so far: the first one is the pid, each of two or more characters the port. */
-static void take_pid_line(char *line, size_t *length, int *first, char *pid, char *port)
-{
-    line[*length] = '\0';
-    if (*first)
-        memcpy(pid, line, PID_TEXT_SIZE);
-    if (strlen(line) >= 2)
-        memcpy(port, line, PID_TEXT_SIZE);
-    *first = 0;
-    *length = 0;
-}
-
 /* The pid file read once: its first line (the pid) and its last line of two or more characters (the
- * port), each without line ends; either may come back empty. Lines are cut at 63 characters, as a
- * 64-byte line buffer would cut them. 0 when the file cannot be read. */
+ * port), each without line ends; either may come back empty. 0 when the file cannot be read. */
 static int read_pid_lines(char *pid, char *port)
 {
     char path[PATH_MAX_TEXT];
     if (!cache_pid_path(path, sizeof(path)))
         return 0;
-    int fd = open(path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0)
+    FILE *file = fopen(path, "re");
+    if (file == NULL)
         return 0;
     memset(pid, 0, PID_TEXT_SIZE);
     memset(port, 0, PID_TEXT_SIZE);
-    char chunk[PID_FILE_CHUNK];
     char line[PID_TEXT_SIZE];
-    size_t length = 0;
-    int first = 1;
-    ssize_t got;
-    do {
-        got = read(fd, chunk, sizeof(chunk));
-        for (ssize_t i = 0; i < got; ++i) {
-            line[length++] = chunk[i];
-            if (chunk[i] == '\n' || length == PID_TEXT_SIZE - 1)
-                take_pid_line(line, &length, &first, pid, port);
-        }
-        /* A regular file reads short only at its end. */
-    } while (got == (ssize_t)sizeof(chunk) || (got < 0 && errno == EINTR));
-    close(fd);
-    if (length > 0)
-        take_pid_line(line, &length, &first, pid, port);
+    for (int first = 1; fgets(line, PID_TEXT_SIZE, file) != NULL; first = 0) {
+        if (first)
+            memcpy(pid, line, PID_TEXT_SIZE);
+        if (strlen(line) >= 2)
+            memcpy(port, line, PID_TEXT_SIZE);
+    }
+    fclose(file);
     for (char *text = pid; text != NULL; text = text == pid ? port : NULL) {
-        size_t end = strlen(text);
-        while (end > 0 && (text[end - 1] == '\n' || text[end - 1] == '\r'))
-            text[--end] = '\0';
+        size_t length = strlen(text);
+        while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
+            text[--length] = '\0';
     }
     return 1;
 }
@@ -236,6 +213,9 @@ static int is_cache_daemon_pid(const char *pid)
     char buffer[CMDLINE_READ_SIZE];
     memset(buffer, 0, sizeof(buffer));
     snprintf(buffer, sizeof(buffer), "/proc/%s/cmdline", pid);
+    struct stat info;
+    if (lstat(buffer, &info) != 0)
+        return 0;
     int fd = open(buffer, O_RDONLY | O_CLOEXEC);
     if (fd < 0)
         return 0;
@@ -256,10 +236,7 @@ int is_cache_daemon_running(void)
     /* Without a pid "/proc//cmdline" would name the kernel's command line. */
     if (!read_pid_file(pid))
         return 0;
-    char path[CMDLINE_READ_SIZE];
-    snprintf(path, sizeof(path), "/proc/%s/cmdline", pid);
-    struct stat info;
-    return lstat(path, &info) == 0 && is_cache_daemon_pid(pid);
+    return is_cache_daemon_pid(pid);
 }
 
 static int parse_port(const char *text, unsigned short *port)
@@ -275,12 +252,16 @@ static int parse_port(const char *text, unsigned short *port)
     return 1;
 }
 
-int cache_daemon_port(unsigned short *port)
+int cache_daemon_port(unsigned short *port, long *pid)
 {
-    char pid[PID_TEXT_SIZE];
+    char pid_text[PID_TEXT_SIZE];
     char text[PID_TEXT_SIZE];
-    return port != NULL && read_pid_lines(pid, text) && pid[0] != '\0' && is_cache_daemon_pid(pid)
-        && parse_port(text, port);
+    if (port == NULL || !read_pid_lines(pid_text, text) || pid_text[0] == '\0' || !is_cache_daemon_pid(pid_text)
+        || !parse_port(text, port))
+        return 0;
+    if (pid != NULL)
+        *pid = strtol(pid_text, NULL, 10);
+    return 1;
 }
 
 int is_connect(int socket)
@@ -320,73 +301,11 @@ static int fail_connection(const char *function, int socket, int line, const cha
     return -1;
 }
 
-/* Connects to the daemon; the socket, or -1 after one log line. */
-static int connect_daemon(const char *function, unsigned short port)
+/* The time seconds from now, for the waits below. */
+static void deadline_in(struct timespec *deadline, int seconds)
 {
-    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0)
-        return fail_connection(function, -1, 288, "socket init failed, code: %d, detail: %s");
-
-    struct sockaddr_in address;
-    memset(&address, 0, sizeof(address));
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    if (port == 0 && (!pid_file_exists() || !read_port(&port)))
-        return fail_connection(function, fd, 297, "read port failed, code: %d, detail: %s");
-    address.sin_port = htons(port);
-
-    if (connect(fd, (struct sockaddr *)&address, sizeof(address)) != 0)
-        return fail_connection(function, fd, 303, "connect socket failed, code: %d, detail: %s");
-    return fd;
-}
-
-/* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
-static int send_query(const char *function, unsigned short port, const void *request, size_t request_length)
-{
-    int fd = connect_daemon(function, port);
-    if (fd < 0)
-        return -1;
-    if (!is_connect(fd)) {
-        close(fd);
-        return -1;
-    }
-
-    set_timeout(fd, SO_SNDTIMEO);
-    /* A send cut short by the time-out would leave the daemon waiting on half a frame. */
-    for (size_t sent = 0; sent < request_length;) {
-        ssize_t now = send(fd, (const char *)request + sent, request_length - sent, MSG_NOSIGNAL);
-        if (now < 0 && errno != EINTR)
-            return fail_connection(function, fd, 313, "send message failed, code: %d, detail: %s");
-        sent += now > 0 ? (size_t)now : 0;
-    }
-    set_timeout(fd, SO_RCVTIMEO);
-    return fd;
-}
-
-int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
-{
-    int fd = send_query("socket_query", 0, request, request_length);
-    if (fd < 0)
-        return 0;
-    ssize_t received = recv(fd, reply, reply_capacity, 0);
-    if (received < 0)
-        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
-    if (received < 4) {
-        /* A peer that closes before a whole length prefix arrived sent no reply. */
-        errno = received == 0 ? ECONNRESET : EPROTO;
-        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
-    }
-
-    uint32_t prefix;
-    memcpy(&prefix, reply, sizeof(prefix));
-    size_t length = ntohl(prefix);
-    size_t available = (size_t)received - 4;
-    /* Only bytes this single receive produced are moved; the rest of the buffer is zeroed. */
-    size_t body = length < available ? length : available;
-    memmove(reply, reply + 4, body);
-    memset(reply + body, 0, reply_capacity - body);
-    close(fd);
-    return 1;
+    clock_gettime(CLOCK_MONOTONIC, deadline);
+    deadline->tv_sec += seconds;
 }
 
 static long milliseconds_until(const struct timespec *deadline)
@@ -426,6 +345,71 @@ static int send_all(int fd, const char *request, size_t length, const struct tim
         else if (now < 0 && errno != EAGAIN && errno != EINTR)
             return 0;
     }
+    return 1;
+}
+
+/* Connects to the daemon; the socket, or -1 after one log line. */
+static int connect_daemon(const char *function, unsigned short port)
+{
+    int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return fail_connection(function, -1, 288, "socket init failed, code: %d, detail: %s");
+
+    struct sockaddr_in address;
+    memset(&address, 0, sizeof(address));
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    if (port == 0 && (!pid_file_exists() || !read_port(&port)))
+        return fail_connection(function, fd, 297, "read port failed, code: %d, detail: %s");
+    address.sin_port = htons(port);
+
+    if (connect(fd, (struct sockaddr *)&address, sizeof(address)) != 0)
+        return fail_connection(function, fd, 303, "connect socket failed, code: %d, detail: %s");
+    return fd;
+}
+
+/* Connects to the daemon and sends the request; the socket, ready to receive, or -1 after one log line. */
+static int send_query(const char *function, unsigned short port, const void *request, size_t request_length)
+{
+    int fd = connect_daemon(function, port);
+    if (fd < 0)
+        return -1;
+    if (!is_connect(fd)) {
+        close(fd);
+        return -1;
+    }
+
+    struct timespec deadline;
+    deadline_in(&deadline, QUERY_TIMEOUT_SECONDS);
+    if (!send_all(fd, request, request_length, &deadline))
+        return fail_connection(function, fd, 313, "send message failed, code: %d, detail: %s");
+    set_timeout(fd, SO_RCVTIMEO);
+    return fd;
+}
+
+int socket_query(const void *request, size_t request_length, unsigned char *reply, size_t reply_capacity)
+{
+    int fd = send_query("socket_query", 0, request, request_length);
+    if (fd < 0)
+        return 0;
+    ssize_t received = recv(fd, reply, reply_capacity, 0);
+    if (received < 0)
+        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
+    if (received < 4) {
+        /* A peer that closes before a whole length prefix arrived sent no reply. */
+        errno = received == 0 ? ECONNRESET : EPROTO;
+        return fail_query("socket_query", fd, 319, "receive message failed, code: %d, detail: %s");
+    }
+
+    uint32_t prefix;
+    memcpy(&prefix, reply, sizeof(prefix));
+    size_t length = ntohl(prefix);
+    size_t available = (size_t)received - 4;
+    /* Only bytes this single receive produced are moved; the rest of the buffer is zeroed. */
+    size_t body = length < available ? length : available;
+    memmove(reply, reply + 4, body);
+    memset(reply + body, 0, reply_capacity - body);
+    close(fd);
     return 1;
 }
 
@@ -483,12 +467,10 @@ int socket_query_frame(unsigned short port, const void *request, size_t request_
         return 0;
     /* However many segments the exchange takes, each way must be done within one time-out. */
     struct timespec deadline;
-    clock_gettime(CLOCK_MONOTONIC, &deadline);
-    deadline.tv_sec += QUERY_TIMEOUT_SECONDS;
+    deadline_in(&deadline, QUERY_TIMEOUT_SECONDS);
     if (!send_all(fd, request, request_length, &deadline))
         return fail_query(function, fd, 313, "send message failed, code: %d, detail: %s");
-    clock_gettime(CLOCK_MONOTONIC, &deadline);
-    deadline.tv_sec += QUERY_TIMEOUT_SECONDS;
+    deadline_in(&deadline, QUERY_TIMEOUT_SECONDS);
     *reply = receive_frame(fd, max_length, &deadline);
     if (*reply == NULL)
         return fail_query(function, fd, 319, "receive message failed, code: %d, detail: %s");

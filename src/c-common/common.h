@@ -44,8 +44,9 @@ int socket_query_frame(
     unsigned short port, const void *request, size_t request_length, char **reply, size_t max_length) KEST_MUST_USE;
 int is_connect(int socket);
 int read_port(unsigned short *port);
-/* One read of the pid file: the port of the cache daemon when the pid it names runs cache-kest. */
-int cache_daemon_port(unsigned short *port);
+/* One read of the pid file: the port of the cache daemon, and its pid when pid is not NULL, when the pid
+ * it names runs cache-kest. */
+int cache_daemon_port(unsigned short *port, long *pid);
 
 #ifdef __cplusplus
 }

@@ -61,7 +61,8 @@ QString accountReply(const CacheControlPtr &record)
     reply.reserve(256);
     reply += "{\"pass\":true,\"user\":";
     appendAccountEntry(reply, *record);
-    return QString::fromUtf8(reply + '}');
+    reply += '}';
+    return QString::fromUtf8(reply);
 }
 } // namespace
 
@@ -361,7 +362,8 @@ QString KestCacheService::listAccounts()
             first = false;
         }
     }
-    return QString::fromUtf8(reply + "]}");
+    reply += "]}";
+    return QString::fromUtf8(reply);
 }
 
 QString KestCacheService::changePassword(

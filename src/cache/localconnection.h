@@ -27,7 +27,6 @@ public:
     void disconnectFromHost();
     void abort();
 
-    bool isConnected() const { return m_descriptor >= 0; }
     // True once the peer has closed its end, even while its last bytes are still unread.
     bool peerHasLeft() const;
     QString errorString() const { return m_error; }

@@ -17,7 +17,6 @@
 
 #define SOURCE_PATH "src/modules/daemon-client"
 #define PROCESS_NAME_SIZE 64
-#define PID_TEXT_SIZE 64
 #define PATH_SIZE 4096
 #define REQUEST_SIZE 16384
 /* A listing of every cached account is the longest reply; far below this even for many thousands. */
@@ -66,9 +65,9 @@ static unsigned short known_port(const struct stat *file)
     return kill(daemon.pid, 0) == 0 || errno == EPERM ? daemon.port : 0;
 }
 
-static void remember(const struct stat *file, const char *pid, unsigned short port)
+static void remember(const struct stat *file, long pid, unsigned short port)
 {
-    struct known_daemon daemon = { file->st_dev, file->st_ino, file->st_size, file->st_mtim, (pid_t)atol(pid), port };
+    struct known_daemon daemon = { file->st_dev, file->st_ino, file->st_size, file->st_mtim, (pid_t)pid, port };
     if (daemon.pid <= 0 || pthread_mutex_trylock(&known_lock) != 0)
         return;
     known = daemon;
@@ -85,8 +84,8 @@ unsigned short kest_daemon_port(void)
     unsigned short port = known_port(&file);
     if (port != 0)
         return port;
-    char pid[PID_TEXT_SIZE];
-    if (!cache_daemon_port(&port) || !read_pid_file(pid))
+    long pid = 0;
+    if (!cache_daemon_port(&port, &pid))
         return 0;
     /* Kept as the file was before it was read: had it changed since, the next look-up reads it again. */
     remember(&file, pid, port);

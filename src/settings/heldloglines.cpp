@@ -8,15 +8,15 @@ thread_local HeldLogLines *holder = nullptr;
 } // namespace
 
 HeldLogLines::HeldLogLines()
-    : m_outermost(holder == nullptr)
 {
-    if (m_outermost)
+    if (!holder)
         holder = this;
 }
 
 HeldLogLines::~HeldLogLines()
 {
-    if (!m_outermost)
+    // An inner one leaves the lines to the outermost.
+    if (holder != this)
         return;
     flush();
     holder = nullptr;

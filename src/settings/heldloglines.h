@@ -24,6 +24,5 @@ private:
         unsigned long ticks;
         QString message;
     };
-    bool m_outermost;
     QList<Line> m_lines;
 };

@@ -1,4 +1,5 @@
 #include "cache-common.h"
+#include "cachedaemonfixture.h"
 #include "common.h"
 #include "loopbackpeer.h"
 #include "syslogcapture.h"
@@ -99,7 +100,7 @@ private Q_SLOTS:
         const bool pidRead = read_pid_file(pidText), portRead = read_port(&port);
         const QByteArrayList seen { QByteArray::number(pid_file_exists()), pidRead ? QByteArray(pidText) : "-",
             QByteArray::number(is_cache_daemon_running()), portRead ? QByteArray::number(port) : "-",
-            cache_daemon_port(&daemonPort) ? QByteArray::number(daemonPort) : "-" };
+            cache_daemon_port(&daemonPort, nullptr) ? QByteArray::number(daemonPort) : "-" };
         QCOMPARE(seen.join(' '), expected.replace("PID", pid));
         sleeper.kill();
         sleeper.waitForFinished();
@@ -144,9 +145,7 @@ private Q_SLOTS:
     {
         QTest::addColumn<QByteArray>("answer");
         QTest::addColumn<QByteArray>("body"); // null: no reply, one error logged
-        const auto frame = [](const QByteArray &body) {
-            return QByteArray::fromHex(QByteArray::number(body.size(), 16).rightJustified(8, '0')) + body;
-        };
+        const auto frame = &CacheDaemonFixture::frame;
         const QByteArray large(100000, 'a');
         QTest::newRow("in one receive") << frame("hello") << QByteArray("hello");
         QTest::newRow("beyond the first receive") << frame(large) << large;

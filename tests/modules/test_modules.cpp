@@ -25,6 +25,11 @@ class ModulesTest : public QObject
     QScopedPointer<Blackhole> m_blackhole;
 
     static QByteArray modulePath(const char *name) { return qgetenv("KEST_TEST_BINARY_DIR") + "/src/modules/" + name; }
+    // An entry point of the loaded name-service module, called the way glibc calls it.
+    template<typename... Arguments> nss_status nss(const char *function, Arguments... arguments) const
+    {
+        return reinterpret_cast<nss_status (*)(Arguments...)>(dlsym(m_nss, function))(arguments...);
+    }
 
 private Q_SLOTS:
     void initTestCase()
@@ -90,9 +95,6 @@ private Q_SLOTS:
         const QByteArrayList parts = call.split(' ');
         const QByteArray function = parts.at(0), key = parts.at(1);
         const size_t size = parts.value(2, "1024").toUInt();
-        const auto nss = [this](const char *function, auto... arguments) {
-            return reinterpret_cast<nss_status (*)(decltype(arguments)...)>(dlsym(m_nss, function))(arguments...);
-        };
         QByteArray buffer(int(size), '\0'), entry;
         int error = 0, status;
         passwd pwd {};
@@ -153,8 +155,7 @@ private Q_SLOTS:
             passwd pwd {};
             char buffer[1024];
             int error = 0;
-            return reinterpret_cast<nss_status (*)(const char *, passwd *, char *, size_t, int *)>(
-                dlsym(m_nss, "_nss_kest_getpwnam_r"))("@alice", &pwd, buffer, sizeof(buffer), &error);
+            return nss("_nss_kest_getpwnam_r", "@alice", &pwd, static_cast<char *>(buffer), sizeof(buffer), &error);
         };
         QCOMPARE(lookUp(first.port()), NSS_STATUS_SUCCESS);
         QCOMPARE(lookUp(second.port()), NSS_STATUS_SUCCESS);
