@@ -1,39 +1,48 @@
 #include "echoserver.h"
 
 #include <arpa/inet.h>
+#include <csignal>
 #include <netinet/in.h>
 #include <sys/socket.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 EchoServer::EchoServer()
 {
-    m_listener = socket(AF_INET, SOCK_STREAM, 0);
+    const int listener = socket(AF_INET, SOCK_STREAM, 0);
     sockaddr_in address {};
     address.sin_family = AF_INET;
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     socklen_t length = sizeof(address);
-    if (bind(m_listener, reinterpret_cast<sockaddr *>(&address), length) != 0 || listen(m_listener, 64) != 0)
+    if (bind(listener, reinterpret_cast<sockaddr *>(&address), length) != 0 || listen(listener, 64) != 0
+        || getsockname(listener, reinterpret_cast<sockaddr *>(&address), &length) != 0) {
+        close(listener);
         return;
-    getsockname(m_listener, reinterpret_cast<sockaddr *>(&address), &length);
-    m_port = ntohs(address.sin_port);
-    m_thread = std::thread(&EchoServer::serve, this);
+    }
+    m_child = fork();
+    if (m_child == 0)
+        serve(listener);
+    close(listener);
+    if (m_child > 0)
+        m_port = ntohs(address.sin_port);
 }
 
 EchoServer::~EchoServer()
 {
-    shutdown(m_listener, SHUT_RDWR);
-    close(m_listener);
-    if (m_thread.joinable())
-        m_thread.join();
+    if (m_child <= 0)
+        return;
+    kill(m_child, SIGKILL);
+    waitpid(m_child, nullptr, 0);
 }
 
-// One frame in, the same frame out, then the connection ends: what the modules' client does.
-void EchoServer::serve()
+// One frame in, the same frame out, then the connection ends: what the modules' client does. Runs in
+// the forked child: system calls only.
+void EchoServer::serve(int listener)
 {
     for (;;) {
-        const int client = accept(m_listener, nullptr, nullptr);
+        const int client = accept(listener, nullptr, nullptr);
         if (client < 0)
-            return;
+            _exit(0);
         char buffer[65536];
         ssize_t have = 0;
         for (;;) {

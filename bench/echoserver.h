@@ -1,20 +1,22 @@
 #pragma once
 
 #include <cstdint>
-#include <thread>
+#include <sys/types.h>
 
-// A trivial framed echo server on 127.0.0.1, on a thread of its own: the floor of a local round trip.
+// A trivial framed echo server on 127.0.0.1 in a process of its own, as cache-kest is: the floor of a
+// local round trip to another process.
 class EchoServer
 {
 public:
     EchoServer();
     ~EchoServer();
+    EchoServer(const EchoServer &) = delete;
+    EchoServer &operator=(const EchoServer &) = delete;
     uint16_t port() const { return m_port; }
 
 private:
-    void serve();
+    static void serve(int listener);
 
-    int m_listener = -1;
     uint16_t m_port = 0;
-    std::thread m_thread;
+    pid_t m_child = -1;
 };

@@ -37,6 +37,7 @@
 
 #include <dlfcn.h>
 #include <pwd.h>
+#include <sched.h>
 #include <unistd.h>
 
 namespace
@@ -64,6 +65,45 @@ bool roundTrip(quint16 port, const QByteArray &frame, QByteArray *reply = nullpt
     return length >= 4;
 }
 
+// The timed client runs on one core and every server it is timed against (echo floor, domain server,
+// daemons) on another, whichever process or thread started them. Left to the scheduler, a round trip
+// to a thread of the client's own process is often served on the client's core, a hand-off no server
+// process gets, and the ratios then measured placement rather than the daemon.
+struct Cores {
+    cpu_set_t client;
+    cpu_set_t server;
+    int clientCpu = -1;
+    int serverCpu = -1;
+};
+Cores cores;
+
+void splitCores()
+{
+    cpu_set_t allowed;
+    CPU_ZERO(&allowed);
+    if (sched_getaffinity(0, sizeof(allowed), &allowed) != 0)
+        return;
+    for (int cpu = 0; cpu < CPU_SETSIZE && cores.serverCpu < 0; ++cpu) {
+        if (!CPU_ISSET(cpu, &allowed))
+            continue;
+        (cores.clientCpu < 0 ? cores.clientCpu : cores.serverCpu) = cpu;
+    }
+    if (cores.serverCpu < 0)
+        return;
+    CPU_ZERO(&cores.client);
+    CPU_SET(cores.clientCpu, &cores.client);
+    CPU_ZERO(&cores.server);
+    CPU_SET(cores.serverCpu, &cores.server);
+}
+
+// Threads and processes inherit the core of the thread that starts them: outside measure() that is
+// the servers' core.
+void runOn(const cpu_set_t &set)
+{
+    if (cores.serverCpu >= 0)
+        sched_setaffinity(0, sizeof(set), &set);
+}
+
 // A floor is sampled alongside the rows held against it, one of its samples before each of theirs, so
 // that both see the same load of a shared machine.
 struct Floor {
@@ -82,11 +122,13 @@ double timed(const std::function<void()> &action)
 QList<double> measure(int count, const std::function<void()> &action, Floor *floor = nullptr)
 {
     QList<double> samples;
+    runOn(cores.client);
     for (int i = 0; i < count; ++i) {
         if (floor)
             floor->row.samples << timed(floor->action);
         samples << timed(action);
     }
+    runOn(cores.server);
     return samples;
 }
 
@@ -132,7 +174,11 @@ QString machine()
             }
         }
     }
-    return model + QStringLiteral(", ") + QString::number(sysconf(_SC_NPROCESSORS_ONLN)) + QStringLiteral(" cores");
+    const QString placement = cores.serverCpu < 0
+        ? QStringLiteral("client and servers on one core")
+        : QStringLiteral("client on CPU %1, servers on CPU %2").arg(cores.clientCpu).arg(cores.serverCpu);
+    return model + QStringLiteral(", ") + QString::number(sysconf(_SC_NPROCESSORS_ONLN)) + QStringLiteral(" cores; ")
+        + placement;
 }
 
 DomainEndpoint endpointOf(const DomainServerFixture &server)
@@ -320,6 +366,8 @@ void print(const QList<Row> &rows, const QStringList &notes)
 
 int main(int argc, char *argv[])
 {
+    splitCores();
+    runOn(cores.server);
     QCoreApplication application(argc, argv);
     const int count = 200;
     TestRoot root;
@@ -343,7 +391,7 @@ int main(int argc, char *argv[])
     QList<Row> rows;
 
     EchoServer echo;
-    Floor loopback { { QStringLiteral("floor: framed loopback round trip"), {}, QString() },
+    Floor loopback { { QStringLiteral("floor: framed loopback round trip to an echo process"), {}, QString() },
         [&] { roundTrip(echo.port(), lookUp); } };
     const DomainEndpoint endpoint = endpointOf(server);
     const QSslConfiguration tls = tlsOf(server);
