@@ -70,10 +70,8 @@ bool roundTrip(quint16 port, const QByteArray &frame, QByteArray *reply = nullpt
 // to a thread of the client's own process is often served on the client's core, a hand-off no server
 // process gets, and the ratios then measured placement rather than the daemon.
 struct Cores {
-    cpu_set_t client;
-    cpu_set_t server;
-    int clientCpu = -1;
-    int serverCpu = -1;
+    int client = -1;
+    int server = -1; // -1: a single core, nothing is moved
 };
 Cores cores;
 
@@ -83,25 +81,22 @@ void splitCores()
     CPU_ZERO(&allowed);
     if (sched_getaffinity(0, sizeof(allowed), &allowed) != 0)
         return;
-    for (int cpu = 0; cpu < CPU_SETSIZE && cores.serverCpu < 0; ++cpu) {
-        if (!CPU_ISSET(cpu, &allowed))
-            continue;
-        (cores.clientCpu < 0 ? cores.clientCpu : cores.serverCpu) = cpu;
+    for (int cpu = 0; cpu < CPU_SETSIZE && cores.server < 0; ++cpu) {
+        if (CPU_ISSET(cpu, &allowed))
+            (cores.client < 0 ? cores.client : cores.server) = cpu;
     }
-    if (cores.serverCpu < 0)
-        return;
-    CPU_ZERO(&cores.client);
-    CPU_SET(cores.clientCpu, &cores.client);
-    CPU_ZERO(&cores.server);
-    CPU_SET(cores.serverCpu, &cores.server);
 }
 
 // Threads and processes inherit the core of the thread that starts them: outside measure() that is
 // the servers' core.
-void runOn(const cpu_set_t &set)
+void runOn(int cpu)
 {
-    if (cores.serverCpu >= 0)
-        sched_setaffinity(0, sizeof(set), &set);
+    if (cores.server < 0)
+        return;
+    cpu_set_t set;
+    CPU_ZERO(&set);
+    CPU_SET(cpu, &set);
+    sched_setaffinity(0, sizeof(set), &set);
 }
 
 // A floor is sampled alongside the rows held against it, one of its samples before each of theirs, so
@@ -174,9 +169,9 @@ QString machine()
             }
         }
     }
-    const QString placement = cores.serverCpu < 0
+    const QString placement = cores.server < 0
         ? QStringLiteral("client and servers on one core")
-        : QStringLiteral("client on CPU %1, servers on CPU %2").arg(cores.clientCpu).arg(cores.serverCpu);
+        : QStringLiteral("client on CPU %1, servers on CPU %2").arg(cores.client).arg(cores.server);
     return model + QStringLiteral(", ") + QString::number(sysconf(_SC_NPROCESSORS_ONLN)) + QStringLiteral(" cores; ")
         + placement;
 }
