@@ -1,17 +1,15 @@
 #include "cachecontrol_1_0.h"
 
 #include "cachecontrolfactory.h"
+#include "wholefile.h"
 
+#include <QBuffer>
 #include <QDataStream>
 #include <QDateTime>
 #include <QDebug>
 #include <QFile>
 #include <QJsonArray>
 #include <QJsonObject>
-
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <limits>
 
@@ -46,20 +44,6 @@ QByteArray zonePlaintext()
 QByteArray zoneCiphertext()
 {
     return QByteArray();
-}
-
-// The file holds the password item: it is created owner-only, and an existing one is narrowed
-// before anything is written into it.
-bool openOwnerOnly(QFile &file, const QString &path)
-{
-    const int fd = ::open(QFile::encodeName(path).constData(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd < 0)
-        return false;
-    if (::fchmod(fd, 0600) != 0 || !file.open(fd, QIODevice::WriteOnly, QFileDevice::AutoCloseHandle)) {
-        ::close(fd);
-        return false;
-    }
-    return true;
 }
 
 QStringList textsOf(const QJsonValue &value)
@@ -99,16 +83,16 @@ bool CacheControl_1_0::writeToFile(const QString &path)
 {
     if (m_version == 0)
         return false;
-    QFile file;
-    if (!openOwnerOnly(file, path)) {
-        warnNotExists(path);
-        return false;
-    }
     recomputeEncryptedZone();
-    QDataStream stream(&file);
+    QByteArray content;
+    QBuffer buffer(&content);
+    buffer.open(QIODevice::WriteOnly);
+    QDataStream stream(&buffer);
     writeFields(stream);
-    file.flush();
-    return true;
+    buffer.close();
+    // The file holds the password item: owner read/write only.
+    QString error;
+    return WholeFile::write(path, content, QFileDevice::ReadOwner | QFileDevice::WriteOwner, error);
 }
 
 bool CacheControl_1_0::readFromFile(const QString &path)

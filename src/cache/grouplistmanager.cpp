@@ -92,7 +92,7 @@ void GroupListManager::loadGroups()
     }
 }
 
-void GroupListManager::saveGroups()
+bool GroupListManager::saveGroups()
 {
     QString text;
     for (const GroupEntryPtr &entry : qAsConst(m_groups)) {
@@ -108,8 +108,12 @@ void GroupListManager::saveGroups()
     }
     QString error;
     if (!WholeFile::write(KestPaths::groupsFile(), text.toUtf8(),
-            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error))
+            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther,
+            error)) {
         qWarning().noquote() << QStringLiteral("cannot write groups file. ");
+        return false;
+    }
+    return true;
 }
 
 bool GroupListManager::lookupSystemGroup(const QString &name, GroupEntry &entry) const

@@ -24,7 +24,8 @@ public:
     ~GroupListManager() override;
 
     void loadGroups();
-    void saveGroups();
+    // False when the file could not be replaced; it then keeps what it held.
+    bool saveGroups();
     void addGroupMember(const QString &name, const QString &user);
     void addUserToGroup(const QString &name, const QString &user);
     void removeGroupMember(const QString &name, const QString &user);

@@ -8,6 +8,7 @@
 #include "passwordpolicy.h"
 #include "peeruid.h"
 #include "settingsfile.h"
+#include "settingsupdate.h"
 
 #include <QDebug>
 #include <QFile>
@@ -306,7 +307,8 @@ QString KestCacheLocalServer::updateCache(LocalConnection *socket, const QJsonVa
     const quint32 uid = quint32(data.toInt());
     if (!QFile::exists(cacheFilePathOfUid(uid)))
         return sendResultReply(socket, 1, QStringLiteral("[UpdateCache] : cache file not exists!!!"));
-    refreshCacheRecord(uid);
+    if (!refreshCacheRecord(uid))
+        return sendResultReply(socket, 1, QStringLiteral("[UpdateCache] : cache file not written!!!"));
     return sendResultReply(socket, 0, QString());
 }
 
@@ -323,8 +325,8 @@ QString KestCacheLocalServer::passwordConfig(LocalConnection *socket, const QJso
                 QStringLiteral("[PasswordConfig] : pw-config json missing field,[pw_strength "
                                "pw_validity pw_history_check first_login offline_login]"));
     }
-    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    PasswordPolicy::write(settings, policy);
+    if (!SettingsUpdate::apply([&policy](QSettings &settings) { PasswordPolicy::write(settings, policy); }))
+        return sendResultReply(socket, 1, QStringLiteral("[PasswordConfig] : cannot write settings file!!!"));
     return sendResultReply(socket, 0, QString());
 }
 

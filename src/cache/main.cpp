@@ -7,13 +7,13 @@
 #include "kestpaths.h"
 #include "messagehandler.h"
 #include "terminatesignalnotifier.h"
+#include "wholefile.h"
 
 #include <QCommandLineParser>
 #include <QCoreApplication>
 #include <QDebug>
 #include <QFile>
 #include <QHostAddress>
-#include <QSaveFile>
 #include <QTextStream>
 #include <QTimer>
 
@@ -25,13 +25,10 @@ namespace
 const int replyTimeoutMs = 30000;
 bool writePidFile(quint16 port)
 {
-    QSaveFile file(KestPaths::cachePidFile());
-    if (!file.open(QIODevice::WriteOnly | QIODevice::Text))
-        return false;
-    file.write(QByteArray::number(qint64(getpid())) + '\n' + QByteArray::number(port) + '\n');
-    file.setPermissions(
-        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
-    return file.commit();
+    QString error;
+    return WholeFile::write(KestPaths::cachePidFile(),
+        QByteArray::number(qint64(getpid())) + '\n' + QByteArray::number(port) + '\n',
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error);
 }
 
 int runDaemon(QCoreApplication &app)

@@ -113,7 +113,7 @@ void UserListManager::appendUser(const UserEntryPtr &entry)
         m_specials.append(entry);
 }
 
-void UserListManager::addUser(const QJsonObject &user)
+bool UserListManager::addUser(const QJsonObject &user)
 {
     auto incoming = UserEntryPtr::create();
     incoming->name = stringOf(user, "name");
@@ -134,7 +134,7 @@ void UserListManager::addUser(const QJsonObject &user)
     if (entry && entry->uid != incoming->uid) {
         qCritical().noquote() << QStringLiteral(
             "critical error: the same username has different UID. system refused login.");
-        return;
+        return false;
     }
     if (entry && entry->gid != incoming->gid) {
         const QString groupName = m_groups ? m_groups->systemGroupName(incoming->gid) : QString();
@@ -156,16 +156,16 @@ void UserListManager::addUser(const QJsonObject &user)
         entry = incoming;
         appendUser(entry);
     }
-    saveSpecials(entry);
+    const bool saved = saveSpecials(entry);
 
     if (!m_groups)
-        return;
+        return saved;
     for (const QString &group : qAsConst(groups))
         m_groups->addUserToGroup(group, entry->name);
-    m_groups->saveGroups();
+    return m_groups->saveGroups() && saved;
 }
 
-void UserListManager::saveSpecials(const UserEntryPtr &entry)
+bool UserListManager::saveSpecials(const UserEntryPtr &entry)
 {
     QString text;
     for (const UserEntryPtr &user : qAsConst(m_specials))
@@ -173,20 +173,21 @@ void UserListManager::saveSpecials(const UserEntryPtr &entry)
                     .arg(user->name, user->password, QString::number(user->uid), QString::number(user->gid),
                         user->gecos, user->home, user->shell);
     QString error;
-    if (!WholeFile::write(KestPaths::specialsFile(), text.toUtf8(),
-            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error))
+    const bool listed = WholeFile::write(KestPaths::specialsFile(), text.toUtf8(),
+        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther, error);
+    if (!listed)
         qWarning().noquote() << QStringLiteral("open specials file failed. ") + error;
 
     if (!entry)
-        return;
+        return listed;
     if (!isValidDomainAccountName(entry->name)) {
         qWarning().noquote() << QStringLiteral("invalid domain account name.");
-        return;
+        return listed;
     }
-    writeCacheRecord(*entry);
+    return writeCacheRecord(*entry) && listed;
 }
 
-void UserListManager::writeCacheRecord(const UserEntry &entry) const
+bool UserListManager::writeCacheRecord(const UserEntry &entry) const
 {
     CacheControlPtr record = createCacheControl();
     record->setVersion(kCacheVersion1_0);
@@ -202,21 +203,21 @@ void UserListManager::writeCacheRecord(const UserEntry &entry) const
     if (previous) {
         record->setLastLoginTime(previous->lastLoginTime());
         if (previous->toJsonString(QJsonDocument::Compact) == record->toJsonString(QJsonDocument::Compact))
-            return;
+            return true;
     }
-    saveCacheRecord(*record);
+    return saveCacheRecord(*record);
 }
 
-void UserListManager::recordLogin(const QString &name)
+bool UserListManager::recordLogin(const QString &name)
 {
     const UserEntryPtr entry = findByName(name);
     if (!entry)
-        return;
+        return false;
     const CacheControlPtr record = loadRecord(entry->uid);
     if (!record)
-        return;
+        return false;
     record->setLastLoginTime(quint64(QDateTime::currentSecsSinceEpoch()));
-    saveCacheRecord(*record);
+    return saveCacheRecord(*record);
 }
 
 void UserListManager::rebuildUsers(HttpHelper *helper)

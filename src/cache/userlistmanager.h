@@ -33,8 +33,9 @@ public:
     explicit UserListManager(GroupListManager *groups, QObject *parent = nullptr);
 
     void loadUsersFromCache();
-    void addUser(const QJsonObject &user);
-    void saveSpecials(const UserEntryPtr &entry);
+    // False when a file could not be replaced (each failure is logged where it happens).
+    bool addUser(const QJsonObject &user);
+    bool saveSpecials(const UserEntryPtr &entry);
     void rebuildUsers(HttpHelper *helper);
     void clearUsers();
 
@@ -48,7 +49,7 @@ public:
     // The lower-case hex SHA-256 of the password against the stored digest.
     bool checkOfflinePassword(const QString &name, const QString &password) const;
     // Stamps the user's cache record with the time of an online login.
-    void recordLogin(const QString &name);
+    bool recordLogin(const QString &name);
 
     static bool isValidDomainAccountName(const QString &name);
     static QString passwordDigest(const QString &password);
@@ -56,7 +57,7 @@ public:
 private:
     UserEntryPtr findByName(const QString &name) const;
     void appendUser(const UserEntryPtr &entry);
-    void writeCacheRecord(const UserEntry &entry) const;
+    bool writeCacheRecord(const UserEntry &entry) const;
 
     GroupListManager *m_groups;
     QList<UserEntryPtr> m_users;

@@ -7,6 +7,7 @@
 #include "grouplistmanager.h"
 #include "kestpaths.h"
 #include "passwordpolicy.h"
+#include "settingsupdate.h"
 #include "userlistmanager.h"
 
 #include <QDBusInterface>
@@ -107,7 +108,8 @@ void DBusKestService::setEnable(bool enable)
         qWarning().noquote() << QStringLiteral("already in destination status.");
         return;
     }
-    writeEnableSetting(enable);
+    if (!writeEnableSetting(enable))
+        return;
     if (enable) {
         // Only the cache is emptied: the session watch stays as it was at start.
         cleanDomainUserCacheFiles();
@@ -117,12 +119,13 @@ void DBusKestService::setEnable(bool enable)
     switchToGreeter();
 }
 
-void DBusKestService::writeEnableSetting(bool enable) const
+bool DBusKestService::writeEnableSetting(bool enable) const
 {
-    QSettings settings(KestPaths::settingsFile(), QSettings::IniFormat);
-    settings.beginGroup(QStringLiteral("main"));
-    settings.setValue(QStringLiteral("enable"), enable);
-    settings.endGroup();
+    return SettingsUpdate::apply([enable](QSettings &settings) {
+        settings.beginGroup(QStringLiteral("main"));
+        settings.setValue(QStringLiteral("enable"), enable);
+        settings.endGroup();
+    });
 }
 
 void DBusKestService::deleteDomainUsersDesktopData()
@@ -293,8 +296,7 @@ bool DBusKestService::DisableTerminal(uint uid)
     if (!record)
         return true;
     record->setRemoveStatus(1);
-    saveCacheRecord(*record);
-    return true;
+    return saveCacheRecord(*record);
 }
 
 QString DBusKestService::ModifyUserPassword(

@@ -54,7 +54,7 @@ private:
     void clearUserObjects();
     void syncLoginSessions();
     void killSession(const QString &sessionId);
-    void writeEnableSetting(bool enable) const;
+    bool writeEnableSetting(bool enable) const;
     void deleteDomainUsersDesktopData();
     void deleteUserDesktopData(const QString &userName);
     void switchToGreeter();

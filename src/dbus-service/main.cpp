@@ -3,6 +3,7 @@
 #include "kestpaths.h"
 #include "messagehandler.h"
 #include "terminatesignalnotifier.h"
+#include "wholefile.h"
 
 #include <QCoreApplication>
 #include <QDBusConnection>
@@ -77,15 +78,13 @@ void writePidFile()
         qWarning().noquote() << QStringLiteral("can not remove invalid pid file.");
         std::exit(3);
     }
-    if (!file.open(QIODevice::Append | QIODevice::Text)) {
-        qWarning().noquote() << QStringLiteral("can not create pid file. error: ") + file.errorString();
+    QString error;
+    if (!WholeFile::write(file.fileName(), QByteArray::number(qint64(getpid())),
+            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther,
+            error)) {
+        qWarning().noquote() << QStringLiteral("can not create pid file. error: ") + error;
         std::exit(3);
     }
-    file.setPermissions(
-        QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther);
-    file.write(QByteArray::number(qint64(getpid())));
-    file.flush();
-    file.close();
     qInfo().noquote() << QStringLiteral("dbus kest service is started.");
 }
 
