@@ -7,6 +7,7 @@
 
 #include <QDebug>
 #include <QFile>
+#include <QSet>
 #include <QTextStream>
 
 #include <dlfcn.h>
@@ -151,6 +152,12 @@ void GroupListManager::addGroupMember(const QString &name, const QString &user)
 
     GroupEntryPtr entry = findGroup(name);
     const bool created = entry.isNull();
+    // Without a number of its own a new group would share another one's: it is not made at all.
+    const uint gid = created && !known && name != kestGroup ? nextFreeGid() : 0;
+    if (created && !known && name != kestGroup && gid == 0) {
+        qWarning().noquote() << QStringLiteral("no free group id for group: ") + name;
+        return;
+    }
     if (created) {
         entry = GroupEntryPtr::create();
         m_groups.append(entry);
@@ -167,7 +174,7 @@ void GroupListManager::addGroupMember(const QString &name, const QString &user)
     } else {
         // A group already in the file keeps its number: files on disk may carry it.
         if (created || entry->gid == 0)
-            entry->gid = name == kestGroup ? kestGid : nextFreeGid();
+            entry->gid = name == kestGroup ? kestGid : gid ? gid : nextFreeGid();
         entry->name = name;
         entry->password = placeholderName;
     }
@@ -223,12 +230,14 @@ QStringList GroupListManager::groupsOfUser(const QString &user) const
 
 uint GroupListManager::nextFreeGid() const
 {
-    uint candidate = firstFreeGid;
-    for (const GroupEntryPtr &entry : m_groups) {
-        if (entry->gid >= candidate && entry->gid <= lastFreeGid)
-            candidate = entry->gid + 1;
+    QSet<uint> used;
+    for (const GroupEntryPtr &entry : m_groups)
+        used.insert(entry->gid);
+    for (uint candidate = firstFreeGid; candidate <= lastFreeGid; ++candidate) {
+        if (!used.contains(candidate) && systemGroupName(candidate).isEmpty())
+            return candidate;
     }
-    return candidate;
+    return 0;
 }
 
 QList<GroupEntryPtr> GroupListManager::groups() const

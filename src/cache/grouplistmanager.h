@@ -32,6 +32,7 @@ public:
     void removeUserFromGroups(const QString &user);
     void removeDomainMembers();
     QStringList groupsOfUser(const QString &user) const;
+    // The lowest gid of 5000-9999 that neither the list nor the machine's own groups use; 0 when none is left.
     uint nextFreeGid() const;
 
     QList<GroupEntryPtr> groups() const;

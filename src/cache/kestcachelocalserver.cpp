@@ -9,6 +9,7 @@
 #include "peeruid.h"
 #include "settingsfile.h"
 #include "settingsupdate.h"
+#include "userlistmanager.h"
 
 #include <QDebug>
 #include <QFile>
@@ -189,6 +190,14 @@ QString KestCacheLocalServer::dispatchFunctionCall(LocalConnection *socket, cons
         QStringList arguments;
         for (const QJsonValue &argument : argv)
             arguments.append(argument.toString());
+        if (name == QLatin1String("authenticatePassword") && !isPasswordPeer(socket, arguments.at(0))) {
+            writeReply(socket, frame(KestCacheService::passReply(false).toUtf8()));
+            return QString();
+        }
+        if (name == QLatin1String("modifyUser") && !isPasswordPeer(socket, accountOfChange(arguments.at(0)))) {
+            sendStatusReply(socket, 1, QStringLiteral("permission denied !!!"));
+            return QString();
+        }
         const QString result = callService(name, arguments);
         const QByteArray payload = function.compactResult
             ? result.toUtf8()
@@ -274,6 +283,24 @@ bool KestCacheLocalServer::isRootPeer(LocalConnection *socket, int command)
     return false;
 }
 
+bool KestCacheLocalServer::isPasswordPeer(LocalConnection *socket, const QString &account)
+{
+    uid_t uid = 0;
+    quint16 peerPort = 0, localPort = 0;
+    const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
+    const bool known = PeerUid::lookup(peer, peerPort, local, localPort, uid);
+    if (known && (uid == 0 || uid == m_service->userList()->uidOfName(account)))
+        return true;
+    const qint64 shown = known ? qint64(uid) : -1;
+    qWarning().noquote() << QStringLiteral("refused password check of %1 from uid %2.").arg(account).arg(shown);
+    return false;
+}
+
+QString KestCacheLocalServer::accountOfChange(const QString &json)
+{
+    return QJsonDocument::fromJson(json.toUtf8()).object().value(QLatin1String("username")).toString();
+}
+
 QString KestCacheLocalServer::cleanCache(LocalConnection *socket, const QJsonValue &data)
 {
     const QString path = cacheFilePathOfUid(data.toString().toUInt());
@@ -341,6 +368,8 @@ QString KestCacheLocalServer::modifyUserPassword(LocalConnection *socket, const 
     if (!request.contains(QLatin1String("username")) || !request.contains(QLatin1String("password"))
         || !request.contains(QLatin1String("old_password")))
         return sendStatusReply(socket, 2, QStringLiteral("请求消息缺少必要的字段,username,password,old_password"));
+    if (!isPasswordPeer(socket, accountOfChange(text)))
+        return sendStatusReply(socket, 1, QStringLiteral("permission denied !!!"));
     const QString reply = m_service->modifyUser(text);
     writeReply(socket, frame(reply.toUtf8()));
     return reply;

@@ -44,6 +44,9 @@ private:
     QString callService(const QString &name, const QStringList &arguments);
     void handleServerCommand(LocalConnection *socket, const QJsonObject &request);
     bool isRootPeer(LocalConnection *socket, int command);
+    // Password checks and changes are answered for root and for the account itself only.
+    bool isPasswordPeer(LocalConnection *socket, const QString &account);
+    static QString accountOfChange(const QString &json);
     QString cleanCache(LocalConnection *socket, const QJsonValue &data);
     QString cleanCacheNotInList(LocalConnection *socket, const QJsonValue &data);
     QString updateCache(LocalConnection *socket, const QJsonValue &data);

@@ -6,10 +6,12 @@
 #include "grouplistmanager.h"
 #include "homedirectoryrepair.h"
 #include "httphelper.h"
+#include "loginthrottle.h"
 #include "offlinelogin.h"
 #include "serverreachability.h"
 #include "userlistmanager.h"
 
+#include <QDateTime>
 #include <QDebug>
 #include <QJsonDocument>
 #include <QThread>
@@ -72,6 +74,7 @@ KestCacheService::KestCacheService(QObject *parent)
     , m_http(std::make_unique<HttpHelper>(m_reachability))
     , m_groups(std::make_unique<GroupListManager>())
     , m_users(std::make_unique<UserListManager>(m_groups.get()))
+    , m_throttle(std::make_unique<LoginThrottle>())
 {
     connect(this, &KestCacheService::updateCache, this, &KestCacheService::onUpdateCache, Qt::AutoConnection);
 }
@@ -156,6 +159,17 @@ QString KestCacheService::passReply(bool pass)
     return pass ? QStringLiteral("{\"pass\":true}") : QStringLiteral("{\"pass\":false}");
 }
 
+LoginThrottle *KestCacheService::loginThrottle() const
+{
+    return m_throttle.get();
+}
+
+QString KestCacheService::lockedReply(qint64 until)
+{
+    const qint64 left = qMax<qint64>(1, until - QDateTime::currentSecsSinceEpoch());
+    return QStringLiteral("{\"pass\":false,\"locked\":%1}").arg(left);
+}
+
 QString KestCacheService::statusReply(int code, const QString &message)
 {
     const QJsonObject object { { QStringLiteral("code"), code }, { QStringLiteral("msg"), message },
@@ -206,8 +220,7 @@ QString KestCacheService::answerLookup(
     const QString name = user.value(QLatin1String("name")).toString();
     if (!name.startsWith(QLatin1Char('@')))
         user.insert(QStringLiteral("name"), QLatin1Char('@') + name);
-    m_users->addUser(user);
-    return passReply(true);
+    return passReply(m_users->addUser(user) != UserListManager::Added::Refused);
 }
 
 QString KestCacheService::queryAccountName(QString name)
@@ -257,12 +270,28 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
             "password should not be x because linux use it to express encrypted password meaning.");
         return passReply(false);
     }
+    const uint uid = m_users->uidOfName(username);
+    if (const qint64 until = m_throttle->lockedUntil(uid))
+        return lockedReply(until);
+    const QString answer = checkPassword(username, password, uid);
+    if (answer == passReply(true))
+        m_throttle->recordSuccess(uid);
+    return answer;
+}
+
+// Only a password found wrong counts toward the limit, and only for an account this machine knows.
+QString KestCacheService::checkPassword(const QString &username, const QString &password, uint uid)
+{
     beginCall();
     const QString reply = m_http->authenticate(username, password, QStringLiteral("password"));
     if (reply == HttpHelper::unreachableReply()) {
-        if (!checkOfflineLogin(username, m_users->uidOfName(username))
-            || !m_users->checkOfflinePassword(username, password))
+        if (!checkOfflineLogin(username, uid))
             return passReply(false);
+        if (!m_users->checkOfflinePassword(username, password)) {
+            if (uid != 0)
+                m_throttle->recordFailure(uid, username);
+            return passReply(false);
+        }
         qInfo().noquote() << QStringLiteral("[authenticatePassword]: Offline login verification successful");
         return passReply(true);
     }
@@ -277,6 +306,8 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
         qInfo().noquote() << QStringLiteral("authenticate for user: ") + username
                 + QStringLiteral(", server returned: ") + reply + QStringLiteral(", compare result: ")
                 + QStringLiteral("false");
+        if (uid != 0)
+            m_throttle->recordFailure(uid, username);
         return passReply(false);
     }
     QJsonObject user;
@@ -284,8 +315,12 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
         qWarning().noquote() << QStringLiteral("user passed by web server but lost themself identification.");
         return passReply(false);
     }
-    m_users->addUser(user);
-    m_users->recordLogin(username);
+    // The server decides the login; files that cannot be stored only mean it is not kept for later.
+    const UserListManager::Added added = m_users->addUser(user);
+    if (added == UserListManager::Added::Refused)
+        return passReply(false);
+    if (added == UserListManager::Added::Written)
+        m_users->recordLogin(username);
     HomeDirectoryRepair::repair(username, *m_users);
     return passReply(true);
 }
@@ -313,15 +348,23 @@ QString KestCacheService::modifyUser(QString json)
         qWarning().noquote() << QStringLiteral("donot validate for not remote account.");
         return statusReply(3, QStringLiteral("校验域账号失败,不能查询到此账户信息"));
     }
+    if (const qint64 until = m_throttle->lockedUntil(uid)) {
+        const qint64 minutes = (until - QDateTime::currentSecsSinceEpoch() + 59) / 60;
+        return statusReply(5, QStringLiteral("account locked, try again in %1 minutes").arg(qMax<qint64>(1, minutes)));
+    }
     beginCall();
     const QString reply = m_http->resetPassword(uid, userName, newPassword, oldPassword);
     if (reply == HttpHelper::unreachableReply() || reply == HttpHelper::refusedReply()) {
         qWarning().noquote() << QStringLiteral("network error or donot authenticate pass.");
         return statusReply(4, QStringLiteral("网络错误,无法修改密码"));
     }
-    // Only a change the server accepted may replace the digest kept for offline logins.
-    if (QJsonDocument::fromJson(reply.toUtf8()).object().value(QLatin1String("code")).toInt(-1) != 0)
+    // Only a change the server accepted may replace the digest kept for offline logins; one it refused is
+    // taken as a wrong old password.
+    if (QJsonDocument::fromJson(reply.toUtf8()).object().value(QLatin1String("code")).toInt(-1) != 0) {
+        m_throttle->recordFailure(uid, userName);
         return reply;
+    }
+    m_throttle->recordSuccess(uid);
     QJsonObject user;
     if (!validateServerAnswer(m_http->queryUserByName(userName), newPassword, user))
         qWarning().noquote() << QStringLiteral("web server successed, but lost user detail information");

@@ -12,6 +12,7 @@
 
 class GroupListManager;
 class HttpHelper;
+class LoginThrottle;
 class ServerReachability;
 class UserListManager;
 
@@ -29,6 +30,7 @@ public:
     QString changePassword(const QString &userName, const QString &newPassword, const QString &oldPassword);
 
     UserListManager *userList() const;
+    LoginThrottle *loginThrottle() const;
 
     // The update worker runs only while the daemon listens, and is stopped before anything it uses
     // is torn down.
@@ -63,6 +65,9 @@ private:
     bool sleepUnlessStopped();
     void beginCall();
     static QString statusReply(int code, const QString &message);
+    // {"pass":false} with the seconds the account stays locked.
+    static QString lockedReply(qint64 until);
+    QString checkPassword(const QString &username, const QString &password, uint uid);
     QString answerLookup(
         const QString &reply, bool known, const QString &offlineMessage, const QString &unknownMessage);
     bool isEnabled() const;
@@ -71,6 +76,7 @@ private:
     std::unique_ptr<HttpHelper> m_http;
     std::unique_ptr<GroupListManager> m_groups;
     std::unique_ptr<UserListManager> m_users;
+    std::unique_ptr<LoginThrottle> m_throttle;
     std::thread m_worker;
     std::mutex m_workerMutex;
     std::condition_variable m_workerWake;

@@ -42,6 +42,8 @@ int runDaemon(QCoreApplication &app)
         qWarning().noquote() << QStringLiteral("cannot install the terminate signal handler.");
     QObject::connect(&terminate, &TerminateSignalNotifier::received, &app, &QCoreApplication::quit);
 
+    // What a crash left half-written never replaced anything: it can go.
+    WholeFile::removeScratchFiles(KestPaths::workDir());
     auto *service = new KestCacheService;
     KestCacheLocalServer server(service);
     const int port = GlobalSetting::instance()->port();

@@ -113,7 +113,7 @@ void UserListManager::appendUser(const UserEntryPtr &entry)
         m_specials.append(entry);
 }
 
-bool UserListManager::addUser(const QJsonObject &user)
+UserListManager::Added UserListManager::addUser(const QJsonObject &user)
 {
     auto incoming = UserEntryPtr::create();
     incoming->name = stringOf(user, "name");
@@ -131,10 +131,12 @@ bool UserListManager::addUser(const QJsonObject &user)
         incoming->shell = QStringLiteral("/bin/bash");
 
     UserEntryPtr entry = findByName(incoming->name);
-    if (entry && entry->uid != incoming->uid) {
+    // A uid that moved, or that another listed account holds, would hand one account's files to another.
+    const UserEntryPtr holder = m_byUid.value(incoming->uid);
+    if ((entry && entry->uid != incoming->uid) || (holder && holder->name != incoming->name)) {
         qCritical().noquote() << QStringLiteral(
             "critical error: the same username has different UID. system refused login.");
-        return false;
+        return Added::Refused;
     }
     if (entry && entry->gid != incoming->gid) {
         const QString groupName = m_groups ? m_groups->systemGroupName(incoming->gid) : QString();
@@ -156,13 +158,13 @@ bool UserListManager::addUser(const QJsonObject &user)
         entry = incoming;
         appendUser(entry);
     }
-    const bool saved = saveSpecials(entry);
-
-    if (!m_groups)
-        return saved;
-    for (const QString &group : qAsConst(groups))
-        m_groups->addUserToGroup(group, entry->name);
-    return m_groups->saveGroups() && saved;
+    bool saved = saveSpecials(entry);
+    if (m_groups) {
+        for (const QString &group : qAsConst(groups))
+            m_groups->addUserToGroup(group, entry->name);
+        saved = m_groups->saveGroups() && saved;
+    }
+    return saved ? Added::Written : Added::NotWritten;
 }
 
 bool UserListManager::saveSpecials(const UserEntryPtr &entry)
@@ -170,7 +172,7 @@ bool UserListManager::saveSpecials(const UserEntryPtr &entry)
     QString text;
     for (const UserEntryPtr &user : qAsConst(m_specials))
         text += QStringLiteral("%1:%2:%3:%4:%5:%6:%7\n")
-                    .arg(user->name, user->password, QString::number(user->uid), QString::number(user->gid),
+                    .arg(user->name, shadowedPassword, QString::number(user->uid), QString::number(user->gid),
                         user->gecos, user->home, user->shell);
     QString error;
     const bool listed = WholeFile::write(KestPaths::specialsFile(), text.toUtf8(),
@@ -202,6 +204,8 @@ bool UserListManager::writeCacheRecord(const UserEntry &entry) const
     const CacheControlPtr previous = loadRecord(entry.uid);
     if (previous) {
         record->setLastLoginTime(previous->lastLoginTime());
+        // Only deleting the record clears its removal mark.
+        record->setRemoveStatus(previous->removeStatus());
         if (previous->toJsonString(QJsonDocument::Compact) == record->toJsonString(QJsonDocument::Compact))
             return true;
     }

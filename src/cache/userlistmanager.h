@@ -33,8 +33,10 @@ public:
     explicit UserListManager(GroupListManager *groups, QObject *parent = nullptr);
 
     void loadUsersFromCache();
-    // False when a file could not be replaced (each failure is logged where it happens).
-    bool addUser(const QJsonObject &user);
+    // NotWritten when a file could not be replaced (each failure is logged where it happens); Refused,
+    // with nothing changed, when the name or the uid is listed with another uid or name.
+    enum class Added { Written, NotWritten, Refused };
+    Added addUser(const QJsonObject &user);
     bool saveSpecials(const UserEntryPtr &entry);
     void rebuildUsers(HttpHelper *helper);
     void clearUsers();

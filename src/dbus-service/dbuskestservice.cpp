@@ -10,6 +10,7 @@
 #include "settingsupdate.h"
 #include "userlistmanager.h"
 
+#include <QDBusConnectionInterface>
 #include <QDBusInterface>
 #include <QDBusMessage>
 #include <QDBusReply>
@@ -302,6 +303,8 @@ bool DBusKestService::DisableTerminal(uint uid)
 QString DBusKestService::ModifyUserPassword(
     const QString &userName, const QString &old_password, const QString &newPassword)
 {
+    if (!callerMayChangePassword(userName))
+        return QStringLiteral("{\"code\":1,\"data\":null,\"msg\":\"permission denied !!!\"}");
     const QJsonObject request { { QStringLiteral("username"), userName }, { QStringLiteral("password"), newPassword },
         { QStringLiteral("old_password"), old_password } };
     // On standard input: every local user can read a command line in /proc.
@@ -366,4 +369,18 @@ void DBusKestService::killSession(const QString &sessionId)
     const QDBusMessage reply = m_connection.call(call, QDBus::Block, kLogindTimeoutMs);
     if (reply.type() == QDBusMessage::ErrorMessage)
         qWarning().noquote() << "[" << kSyncTag << "] terminate session failed. " << reply.errorMessage();
+}
+
+bool DBusKestService::callerMayChangePassword(const QString &userName) const
+{
+    if (!calledFromDBus())
+        return true;
+    const QDBusReply<uint> caller = connection().interface()->serviceUid(message().service());
+    quint32 uid = 0;
+    if (caller.isValid() && (caller.value() == 0 || (findCacheUidByAccount(userName, uid) && caller.value() == uid)))
+        return true;
+    qWarning().noquote() << QStringLiteral("refused password check of %1 from uid %2.")
+                                .arg(userName)
+                                .arg(caller.isValid() ? qint64(caller.value()) : -1);
+    return false;
 }

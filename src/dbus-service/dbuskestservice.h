@@ -3,6 +3,7 @@
 #include "dbuskesttypes.h"
 
 #include <QDBusConnection>
+#include <QDBusContext>
 #include <QDBusObjectPath>
 #include <QMap>
 #include <QObject>
@@ -15,7 +16,7 @@ class QDBusInterface;
 
 // The front service's main object, published at /com/nimbal/kest/iam. Every public slot and the Enable
 // property are the D-Bus interface; plain members stay off the bus.
-class DBusKestService : public QObject
+class DBusKestService : public QObject, protected QDBusContext
 {
     Q_OBJECT
     Q_CLASSINFO("D-Bus Interface", "com.nimbal.kest.iam")
@@ -50,6 +51,8 @@ public Q_SLOTS:
     void SessionNew(const QString &sessionName, const QDBusObjectPath &path);
 
 private:
+    // Root and the account itself may change its password; callers from outside the bus are trusted.
+    bool callerMayChangePassword(const QString &userName) const;
     void watchLoginSessions();
     void clearUserObjects();
     void syncLoginSessions();

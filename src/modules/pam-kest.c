@@ -30,6 +30,28 @@ struct options {
     int debug;
 };
 
+/* A locked account is told how long it stays locked; the daemon gives the seconds left. */
+static void tell_lock(pam_handle_t *pamh, int flags, const char *reply)
+{
+    long long seconds = 0;
+    if (pamh == NULL || (flags & PAM_SILENT) || !json_integer(json_member(reply, "locked"), &seconds) || seconds <= 0)
+        return;
+    pam_error(pamh, "account locked after too many failed logins, try again in %lld minutes", (seconds + 59) / 60);
+}
+
+static enum answer ask_telling(
+    pam_handle_t *pamh, int flags, unsigned short port, const char *function, const char *const *argv, size_t argc)
+{
+    char *reply = NULL;
+    if (!kest_call(port, function, argv, argc, &reply))
+        return ANSWER_NO_DAEMON;
+    enum answer answer = kest_reply_passed(reply) ? ANSWER_YES : ANSWER_NO;
+    if (answer == ANSWER_NO)
+        tell_lock(pamh, flags, reply);
+    free(reply);
+    return answer;
+}
+
 /* use_first_pass and try_first_pass are read by pam_get_authtok itself. */
 static struct options read_options(int argc, const char **argv)
 {
@@ -62,17 +84,11 @@ static int result_of(enum stage stage, enum answer answer, const char *user, con
 
 static enum answer ask(unsigned short port, const char *function, const char *const *argv, size_t argc)
 {
-    char *reply = NULL;
-    if (!kest_call(port, function, argv, argc, &reply))
-        return ANSWER_NO_DAEMON;
-    enum answer answer = kest_reply_passed(reply) ? ANSWER_YES : ANSWER_NO;
-    free(reply);
-    return answer;
+    return ask_telling(NULL, 0, port, function, argv, argc);
 }
 
 PAM_EXTERN int pam_sm_authenticate(pam_handle_t *pamh, int flags, int argc, const char **argv)
 {
-    (void)flags;
     struct options options = read_options(argc, argv);
     const char *user = network_user(pamh);
     if (user == NULL)
@@ -85,7 +101,7 @@ PAM_EXTERN int pam_sm_authenticate(pam_handle_t *pamh, int flags, int argc, cons
     if (got != PAM_SUCCESS || password == NULL)
         return got == PAM_SUCCESS ? PAM_AUTH_ERR : got;
     const char *arguments[] = { user, password };
-    return result_of(STAGE_AUTH, ask(port, "authenticatePassword", arguments, 2), user, &options);
+    return result_of(STAGE_AUTH, ask_telling(pamh, flags, port, "authenticatePassword", arguments, 2), user, &options);
 }
 
 PAM_EXTERN int pam_sm_setcred(pam_handle_t *pamh, int flags, int argc, const char **argv)
