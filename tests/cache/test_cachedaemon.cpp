@@ -316,6 +316,49 @@ private Q_SLOTS:
         QVERIFY(s->run("--clean-cache", "1").startsWith("1 stderr: cannot connect to cache-kest on 127.0.0.1:"));
     }
 
+    // Password checks and changes are answered for root and the account itself only, and a refused call counts
+    // nothing. Three wrong passwords lock the account without asking the server, across a restart too, until the
+    // delay has passed.
+    void passwordGuessingStops()
+    {
+        s.reset(new Setup);
+        QVERIFY2(s->start(), qPrintable(s->server.errorText() + s->daemon.errorText()));
+        QVERIFY(s->root.writeSettings(s->server.settingsIni({ { QStringLiteral("main/enable"), true },
+            { QStringLiteral("main/failed-login-delay"), 4 }, { QStringLiteral("offline_login/enable"), true } })));
+        QCOMPARE(s->lookUp("@alice"), passTrue);
+        const auto check = [](const char *password) {
+            return CacheDaemonFixture::functionCall(
+                QStringLiteral("authenticatePassword"), { QStringLiteral("@alice"), QLatin1String(password) });
+        };
+        const QString change
+            = QStringLiteral(R"({"username":"@alice","password":"n","old_password":"alice-password"})");
+        const QByteArray denied = status(1, "permission denied !!!");
+        QElapsedTimer clock;
+        clock.start();
+        int guesses = 0, through = 0;
+        for (; clock.elapsed() < 1000; ++guesses)
+            through += s->daemon.requestAsUser(65534, check(guesses % 5 ? "wrong" : "alice-password")) == passTrue;
+        qInfo("another uid: %d of %d guesses in 1 s got through", through, guesses);
+        QCOMPARE(through, 0);
+        QCOMPARE((Replies { s->daemon.requestAsUser(
+                                65534, CacheDaemonFixture::functionCall(QStringLiteral("modifyUser"), { change })),
+                     s->daemon.requestAsUser(65534, command(5, change)),
+                     s->daemon.requestAsUser(10001, check("alice-password")) }),
+            (Replies { denied, denied, passTrue }));
+
+        QCOMPARE((Replies { s->login("@alice", "a"), s->login("@alice", "b"), s->login("@alice", "c") }),
+            (Replies { passFalse, passFalse, passFalse }));
+        QVERIFY(s->server.clearRequests());
+        QVERIFY(s->login("@alice", "alice-password").startsWith(R"({"pass":false,"locked":)"));
+        QCOMPARE(
+            s->daemon.requestAsUser(10001, check("alice-password")).left(23), QByteArray(R"({"pass":false,"locked":)"));
+        QCOMPARE(s->server.requests().size(), 0);
+        QCOMPARE(s->daemon.stop(), 0);
+        QVERIFY(s->daemon.start());
+        QVERIFY(s->login("@alice", "alice-password").startsWith(R"({"pass":false,"locked":)"));
+        QTRY_COMPARE_WITH_TIMEOUT(s->login("@alice", "alice-password"), passTrue, 8000);
+    }
+
     void cleanupTestCase()
     {
         QCOMPARE(m_daemon.stop(), 0);
