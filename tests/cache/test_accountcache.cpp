@@ -311,7 +311,8 @@ private Q_SLOTS:
         QTest::newRow("non-ASCII letters") << QStringLiteral("\u674e\u96f7") << false;
     }
 
-    // Home and shell defaults ignore the home setting; special names go to the specials file only.
+    // Home and shell defaults ignore the home setting; special names go to the specials file only, which is
+    // readable by all and so never holds the digest.
     void namesDecideTheFile()
     {
         QFETCH(QString, name);
@@ -323,7 +324,7 @@ private Q_SLOTS:
         const QStringList permissions { QStringLiteral("lp"), QStringLiteral("kest") };
         users.addUser(user(name, 10005, digest, permissions));
         const QString home = QStringLiteral("/home/") + name;
-        const QString line = QStringLiteral("%1:%2:10005:10000::%3:/bin/bash\n").arg(name, digest, home);
+        const QString line = QStringLiteral("%1:x:10005:10000::%2:/bin/bash\n").arg(name, home);
         QCOMPARE(root.readFile(QStringLiteral("/var/lib/libkest-iam/specials.txt")), special ? line.toUtf8() : "");
         const CacheControlPtr saved = readCacheRecord(10005);
         QCOMPARE(saved ? saved->account() + saved->password() + saved->homePath() : QString(),
@@ -339,7 +340,8 @@ private Q_SLOTS:
         GroupListManager groups;
         UserListManager users(&groups);
         users.addUser(user(alice, 10001));
-        users.addUser(user(alice, 10002, digest, { QStringLiteral("sudo") }));
+        QCOMPARE(
+            users.addUser(user(alice, 10002, digest, { QStringLiteral("sudo") })), UserListManager::Added::Refused);
         QCOMPARE(SyslogCapture::matching("system refused login.").value(0).priority, 2); // another uid for the name
         QVERIFY(!readCacheRecord(10002) && !groups.groupsOfUser(alice).contains(QStringLiteral("sudo")));
 
@@ -350,8 +352,20 @@ private Q_SLOTS:
         QVERIFY(readCacheRecord(10001)->password() == digest && readCacheRecord(10001)->lastLoginTime() == login);
         QVERIFY(groups.groupsOfUser(alice).contains(QStringLiteral("users")));
 
-        users.addUser(user(QStringLiteral("@alice2"), 10001)); // listed after alice: the uid still finds her
-        QVERIFY(users.entryOfUid(10001)->name == alice && users.uidOfName(QStringLiteral("@alice2")) == 10001u);
+        // Another name for a listed uid would take over that account's files: refused, nothing written.
+        QCOMPARE(users.addUser(user(QStringLiteral("@dave"), 10001)), UserListManager::Added::Refused);
+        QVERIFY(readCacheRecord(10001)->account() == alice && !users.hasUserName(QStringLiteral("@dave")));
+    }
+
+    // The removal mark outlives a rewrite of the record; only deleting the record clears it.
+    void removalMarkSurvives()
+    {
+        TestRoot root;
+        QVERIFY(writeRecord(10001, "@alice", 1));
+        GroupListManager groups;
+        UserListManager users(&groups);
+        QCOMPARE(users.addUser(user(alice, 10001, digest, { QStringLiteral("lp") })), UserListManager::Added::Written);
+        QCOMPARE(readCacheRecord(10001)->removeStatus(), 1u);
     }
 
     // Records marked for removal or of only the version (uid 0, no name) are never listed; of two of one name the
@@ -389,12 +403,12 @@ private Q_SLOTS:
         QTest::addColumn<QByteArray>("file"); // null: no groups file
         QTest::addColumn<uint>("firstFree");
         QTest::newRow("no file") << QByteArray() << 5000u;
-        QTest::newRow("5000 and 7000") << QByteArray("a:x:5000:\nb:x:7000:\n") << 7001u;
-        QTest::newRow("7000 before 5000") << QByteArray("b:x:7000:\na:x:5000:\n") << 7001u;
+        QTest::newRow("5000 and 7000") << QByteArray("a:x:5000:\nb:x:7000:\n") << 5001u;
+        QTest::newRow("7000 before 5000") << QByteArray("b:x:7000:\na:x:5000:\n") << 5001u;
         QTest::newRow("above the range") << QByteArray("a:x:10500:\n") << 5000u;
     }
 
-    // The machine's standard groups keep its gids and members; the others take free gids in turn.
+    // The machine's standard groups keep its gids and members; the others take the lowest free gids in turn.
     void standardGroupsAndGids()
     {
         QFETCH(QByteArray, file);
