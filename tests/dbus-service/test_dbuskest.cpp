@@ -313,6 +313,11 @@ private Q_SLOTS:
             "()");
         row("another account's Password", nobody, "/user10002", get, "(<'x'>,)");
         row("its own Password", nobody, "/user65534", get, "(<'digest-of-@nobody'>,)");
+        // Only root and the account itself may change (and so test) its password: no cache-kest for the others.
+        row("changes another's password", nobody, "", "com.nimbal.kest.iam.ModifyUserPassword '@bob' 'old' 'new'",
+            R"(('{"code":1,"data":null,"msg":"permission denied !!!"}',))");
+        row("changes its own password", nobody, "", "com.nimbal.kest.iam.ModifyUserPassword '@nobody' 'old' 'new'",
+            R"(('{"code":0}',))");
         row("root reads an entry", "--reuid=0", "/user10002", getAll,
             "({'Gecos': <'Full Name of @bob'>, 'Gid': <uint32 10102>, 'HomeDir': <'/home/remote/@bob'>, "
             "'Password': <'digest-of-@bob'>, 'Shell': <'/bin/zsh'>, 'Uid': <uint32 10002>, 'UserName': <'@bob'>},)");
