@@ -10,6 +10,7 @@
 #include "serverreachability.h"
 #include "userlistmanager.h"
 
+#include <QDateTime>
 #include <QDebug>
 #include <QJsonDocument>
 #include <QThread>
@@ -72,6 +73,7 @@ KestCacheService::KestCacheService(QObject *parent)
     , m_http(std::make_unique<HttpHelper>(m_reachability))
     , m_groups(std::make_unique<GroupListManager>())
     , m_users(std::make_unique<UserListManager>(m_groups.get()))
+    , m_startedAt(QDateTime::currentSecsSinceEpoch())
 {
     connect(this, &KestCacheService::updateCache, this, &KestCacheService::onUpdateCache, Qt::AutoConnection);
 }
@@ -139,6 +141,7 @@ void KestCacheService::onUpdateCache()
     }
     m_http->setCallDeadline(QDeadlineTimer(QDeadlineTimer::Forever));
     m_users->rebuildUsers(m_http.get());
+    m_lastRefresh = QDateTime::currentSecsSinceEpoch();
 }
 
 bool KestCacheService::isEnabled() const
@@ -372,4 +375,16 @@ QString KestCacheService::changePassword(
     if (!isEnabled())
         return passReply(false);
     return m_http->resetPassword(m_users->uidOfName(userName), userName, newPassword, oldPassword);
+}
+
+ServerReachability::Snapshot KestCacheService::serverState() const
+{
+    return m_reachability->snapshot();
+}
+
+qint64 KestCacheService::loginLockedUntil(uint uid) const
+{
+    // The lock of repeated failed password checks is kept by the login throttle, once the service has one.
+    Q_UNUSED(uid)
+    return 0;
 }
