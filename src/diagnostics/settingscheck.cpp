@@ -10,6 +10,8 @@
 #include <QSslCertificate>
 #include <QTextStream>
 
+#include <algorithm>
+
 namespace
 {
 using Severity = SettingsFinding::Severity;
@@ -54,6 +56,7 @@ private:
     QSettings m_settings;
     QList<SettingsFinding> m_findings;
     QHash<QString, Entry> m_files; // the certificate and key entries that could be read, by key
+    QHash<QString, int> m_lines; // "group/key" to the line that gives it
     QList<QSslCertificate> m_chain;
 };
 
@@ -85,8 +88,10 @@ QList<Entry> Checker::scanLines()
                 QStringLiteral("not a key=value line, ignored: ") + line);
             continue;
         }
-        if (knownGroup)
-            entries.append(Entry { group, line.left(equals).trimmed(), number });
+        if (!knownGroup)
+            continue;
+        entries.append(Entry { group, line.left(equals).trimmed(), number });
+        m_lines.insert(group + QLatin1Char('/') + entries.last().key, number);
     }
     return entries;
 }
@@ -181,7 +186,7 @@ void Checker::checkUnset()
     for (const char *name : { "server-cert", "public-key", "private-key" }) {
         const QString key = QLatin1String(name);
         if (m_settings.value(QStringLiteral("url/") + key).toString().isEmpty())
-            add(Severity::Warning, Entry { QStringLiteral("url"), key, 0 },
+            add(Severity::Warning, Entry { QStringLiteral("url"), key, m_lines.value(QStringLiteral("url/") + key) },
                 QStringLiteral("not set, while the service is switched on and the protocol is https://"));
     }
 }
@@ -199,6 +204,8 @@ QList<SettingsFinding> Checker::run()
         checkEntry(entry);
     checkKeyPair();
     checkUnset();
+    std::stable_sort(m_findings.begin(), m_findings.end(),
+        [](const SettingsFinding &a, const SettingsFinding &b) { return a.line < b.line; });
     return m_findings;
 }
 } // namespace
