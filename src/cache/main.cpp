@@ -185,7 +185,7 @@ int runStatus(QCoreApplication &app, const QString &account, bool json)
     const int result = app.exec();
     if (result < 0)
         return notRunning(QStringLiteral("no reply from cache-kest within %1 s").arg(replyTimeoutMs / 1000));
-    return result == 0 ? status : 2;
+    return result == 0 ? status : result;
 }
 } // namespace
 
