@@ -229,8 +229,9 @@ int main(int argc, char *argv[])
     for (const auto &command : commands)
         parser.addOption(command.second);
     const QCommandLineOption status(QStringLiteral("status"),
-        QStringLiteral("Show the daemon's state, and the accounts you may see (all for root; one given by name or uid). "
-                       "Exit status 0 online, 1 offline, 2 not running or switched off."));
+        QStringLiteral(
+            "Show the daemon's state, and the accounts you may see (all for root; one given by name or uid). "
+            "Exit status 0 online, 1 offline, 2 not running or switched off."));
     const QCommandLineOption json(QStringLiteral("json"), QStringLiteral("With --status: one JSON object."));
     const QCommandLineOption checkConfig(QStringLiteral("check-config"),
         QStringLiteral("Check the settings file (or FILE). Exit status 0 clean, 1 warnings, 2 errors."));
