@@ -35,7 +35,7 @@ QString KestCacheClient::resultReply(int retVal, const QString &message)
 
 QString KestCacheClient::sendCommand(int command, const QByteArray &argument)
 {
-    if (command != 1 && command != 2 && command != 3 && command != 5)
+    if (command != 1 && command != 2 && command != 3 && command != 5 && command != statusCommand)
         return resultReply(1, QStringLiteral("invalid command"));
     // Every argument travels as a JSON string, even where the server reads a number.
     const QJsonObject request { { QStringLiteral("command"), command },
@@ -44,6 +44,12 @@ QString KestCacheClient::sendCommand(int command, const QByteArray &argument)
     m_socket->write(KestCacheLocalServer::frame(text));
     m_socket->flush();
     return QString::fromUtf8(text);
+}
+
+bool KestCacheClient::isErrorReply(const QJsonObject &reply)
+{
+    return reply.contains(QLatin1String("errorInfo")) || reply.value(QLatin1String("retVal")).toInt() != 0
+        || reply.value(QLatin1String("code")).toInt() != 0;
 }
 
 bool KestCacheClient::showCache(const QByteArray &argument, QTextStream &out, QTextStream &err)

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <QAbstractSocket>
+#include <QJsonObject>
 #include <QObject>
 
 class QTcpSocket;
@@ -21,6 +22,11 @@ public:
     // Command 6: prints a user's cache record from the local store.
     static bool showCache(const QByteArray &argument, QTextStream &out, QTextStream &err);
     static QString resultReply(int retVal, const QString &message);
+    // Whether the daemon's reply reports a failure, whichever of its reply shapes it has.
+    static bool isErrorReply(const QJsonObject &reply);
+
+    // The daemon's state (and the accounts the caller may see) instead of a change.
+    static const int statusCommand = 7;
 
     static const int connectTimeoutMs = 30000;
 

@@ -9,6 +9,7 @@
 #include "peeruid.h"
 #include "settingsfile.h"
 #include "settingsupdate.h"
+#include "statusreport.h"
 #include "userlistmanager.h"
 
 #include <QDebug>
@@ -263,6 +264,9 @@ void KestCacheLocalServer::handleServerCommand(LocalConnection *socket, const QJ
         qDebug().noquote() << QStringLiteral("---------------ServerCommand::ModifyUserPasswd");
         modifyUserPassword(socket, data);
         return;
+    case 7:
+        sendStatus(socket, data);
+        return;
     default:
         sendResultReply(socket, 1, QStringLiteral("invalid command!!!"));
     }
@@ -373,4 +377,15 @@ QString KestCacheLocalServer::modifyUserPassword(LocalConnection *socket, const 
     const QString reply = m_service->modifyUser(text);
     writeReply(socket, frame(reply.toUtf8()));
     return reply;
+}
+
+// Open to every local user: the general state for anyone, an account's part for root and the account itself.
+void KestCacheLocalServer::sendStatus(LocalConnection *socket, const QJsonValue &data)
+{
+    uid_t uid = 0;
+    quint16 peerPort = 0, localPort = 0;
+    const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
+    const qint64 peerUid = PeerUid::lookup(peer, peerPort, local, localPort, uid) ? qint64(uid) : -1;
+    const QJsonObject status = StatusReport::build(*m_service, peerUid, data.toString().trimmed());
+    socket->write(frame(QJsonDocument(status).toJson(QJsonDocument::Compact)));
 }

@@ -52,6 +52,7 @@ private:
     QString updateCache(LocalConnection *socket, const QJsonValue &data);
     QString passwordConfig(LocalConnection *socket, const QJsonValue &data);
     QString modifyUserPassword(LocalConnection *socket, const QJsonValue &data);
+    void sendStatus(LocalConnection *socket, const QJsonValue &data);
 
     std::unique_ptr<KestCacheService> m_service;
     QList<LocalConnection *> m_pending;

@@ -75,6 +75,7 @@ KestCacheService::KestCacheService(QObject *parent)
     , m_groups(std::make_unique<GroupListManager>())
     , m_users(std::make_unique<UserListManager>(m_groups.get()))
     , m_throttle(std::make_unique<LoginThrottle>())
+    , m_startedAt(QDateTime::currentSecsSinceEpoch())
 {
     connect(this, &KestCacheService::updateCache, this, &KestCacheService::onUpdateCache, Qt::AutoConnection);
 }
@@ -142,6 +143,7 @@ void KestCacheService::onUpdateCache()
     }
     m_http->setCallDeadline(QDeadlineTimer(QDeadlineTimer::Forever));
     m_users->rebuildUsers(m_http.get());
+    m_lastRefresh = QDateTime::currentSecsSinceEpoch();
 }
 
 bool KestCacheService::isEnabled() const
@@ -415,4 +417,9 @@ QString KestCacheService::changePassword(
     if (!isEnabled())
         return passReply(false);
     return m_http->resetPassword(m_users->uidOfName(userName), userName, newPassword, oldPassword);
+}
+
+ServerReachability::Snapshot KestCacheService::serverState() const
+{
+    return m_reachability->snapshot();
 }

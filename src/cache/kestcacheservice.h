@@ -1,5 +1,7 @@
 #pragma once
 
+#include "serverreachability.h"
+
 #include <QJsonObject>
 #include <QObject>
 #include <QString>
@@ -39,6 +41,12 @@ public:
 
     // All the network time one function call may take, so that callers waiting 5 s always get an answer.
     static const int callNetworkBudgetMs = 4000;
+
+    // What the status command shows: the server as the requests and the probe found it, when the local
+    // users were last refreshed from it, when this daemon started (seconds since the epoch, 0: never).
+    ServerReachability::Snapshot serverState() const;
+    qint64 lastRefresh() const { return m_lastRefresh.load(); }
+    qint64 startedAt() const { return m_startedAt; }
 
     static QString passReply(bool pass);
     // Takes the user object out of a server answer and puts the password's digest (or "x") in it.
@@ -81,4 +89,6 @@ private:
     std::mutex m_workerMutex;
     std::condition_variable m_workerWake;
     std::atomic<bool> m_stopWorker { false };
+    std::atomic<qint64> m_lastRefresh { 0 };
+    qint64 m_startedAt;
 };

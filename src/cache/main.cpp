@@ -6,6 +6,11 @@
 #include "kestcacheservice.h"
 #include "kestpaths.h"
 #include "messagehandler.h"
+#include "settingscheck.h"
+#include "settingsfile.h"
+#include "settingsschema.h"
+#include "settingswatch.h"
+#include "statusprinter.h"
 #include "terminatesignalnotifier.h"
 #include "wholefile.h"
 
@@ -14,6 +19,7 @@
 #include <QDebug>
 #include <QFile>
 #include <QHostAddress>
+#include <QJsonDocument>
 #include <QTextStream>
 #include <QTimer>
 
@@ -23,6 +29,23 @@
 namespace
 {
 const int replyTimeoutMs = 30000;
+// Beside 1 (cannot listen) and 2 (not root): the settings name no usable port.
+const int invalidPortStatus = 3;
+
+// The port to listen on, or 0 after telling the log and standard error why there is none.
+int checkedPort()
+{
+    QString problem;
+    const int port = SettingsSchema::portValue(
+        SettingsFile::value(QStringLiteral("main"), QStringLiteral("port"), 10080), &problem);
+    if (port != 0)
+        return port;
+    const QString text = QStringLiteral("configuration error: [main] port: ") + problem + QStringLiteral(" in ")
+        + KestPaths::settingsFile() + QStringLiteral("; cache-kest stops.");
+    qCritical().noquote() << text;
+    QTextStream(stderr) << text << Qt::endl;
+    return 0;
+}
 bool writePidFile(quint16 port)
 {
     QString error;
@@ -44,9 +67,13 @@ int runDaemon(QCoreApplication &app)
 
     // What a crash left half-written never replaced anything: it can go.
     WholeFile::removeScratchFiles(KestPaths::workDir());
+    SettingsWatch settingsWatch(KestPaths::settingsFile(), isatty(STDERR_FILENO) == 1);
+    settingsWatch.start();
+    const int port = checkedPort();
+    if (port == 0)
+        return invalidPortStatus;
     auto *service = new KestCacheService;
     KestCacheLocalServer server(service);
-    const int port = GlobalSetting::instance()->port();
     if (!server.listen(QHostAddress(QStringLiteral("127.0.0.1")), quint16(port))) {
         qCritical().noquote() << QStringLiteral("cannot listen on 127.0.0.1:") + QString::number(port)
                 + QStringLiteral(", error: ") + server.errorString();
@@ -101,7 +128,7 @@ int runClient(QCoreApplication &app, int command, const QByteArray &argument)
             return;
         }
         out << QString::fromUtf8(payload) << Qt::endl;
-        app.exit(0);
+        app.exit(KestCacheClient::isErrorReply(QJsonDocument::fromJson(payload).object()) ? 1 : 0);
     });
     QTimer::singleShot(replyTimeoutMs, &app, [&]() {
         err << "no reply from cache-kest within " << replyTimeoutMs / 1000 << " s" << Qt::endl;
@@ -109,6 +136,55 @@ int runClient(QCoreApplication &app, int command, const QByteArray &argument)
     });
     client.sendCommand(command, argument);
     return app.exec();
+}
+int runCheckConfig(const QStringList &files)
+{
+    const QString path = files.isEmpty() ? KestPaths::settingsFile() : files.first();
+    const QList<SettingsFinding> findings = SettingsCheck::check(path);
+    QTextStream out(stdout);
+    for (const SettingsFinding &finding : findings)
+        out << finding.text(path) << Qt::endl;
+    return SettingsCheck::exitStatus(findings);
+}
+
+// Exit status 2 also when the daemon cannot be asked: not running is as bad as switched off.
+int runStatus(QCoreApplication &app, const QString &account, bool json)
+{
+    QTextStream out(stdout);
+    QTextStream err(stderr);
+    const auto notRunning = [&](const QString &why) {
+        if (json)
+            out << R"({"running":false})" << Qt::endl;
+        err << why << Qt::endl;
+        return 2;
+    };
+    KestCacheClient client;
+    const quint16 port = daemonPort();
+    if (!client.connectToServer(QStringLiteral("127.0.0.1"), port))
+        return notRunning(QStringLiteral("cache-kest is not running (nothing answers on 127.0.0.1:%1)").arg(port));
+    int status = 2;
+    QObject::connect(&client, &KestCacheClient::replyReceived, &app, [&](const QByteArray &payload, bool) {
+        QJsonObject reply = QJsonDocument::fromJson(payload).object();
+        if (KestCacheClient::isErrorReply(reply)) {
+            err << reply.value(QLatin1String("errorMessage")).toString() << Qt::endl;
+            app.exit(1);
+            return;
+        }
+        reply.remove(QStringLiteral("retVal"));
+        reply.remove(QStringLiteral("errorMessage"));
+        reply.insert(QStringLiteral("running"), true);
+        status = StatusPrinter::exitStatus(reply);
+        out << (json ? QString::fromUtf8(QJsonDocument(reply).toJson(QJsonDocument::Indented))
+                     : StatusPrinter::text(reply));
+        out.flush();
+        app.exit(0);
+    });
+    QTimer::singleShot(replyTimeoutMs, &app, [&]() { app.exit(-1); });
+    client.sendCommand(KestCacheClient::statusCommand, account.toUtf8());
+    const int result = app.exec();
+    if (result < 0)
+        return notRunning(QStringLiteral("no reply from cache-kest within %1 s").arg(replyTimeoutMs / 1000));
+    return result == 0 ? status : result;
 }
 } // namespace
 
@@ -151,7 +227,21 @@ int main(int argc, char *argv[])
     };
     for (const auto &command : commands)
         parser.addOption(command.second);
+    const QCommandLineOption status(QStringLiteral("status"),
+        QStringLiteral(
+            "Show the daemon's state, and the accounts you may see (all for root; one given by name or uid). "
+            "Exit status 0 online, 1 offline, 2 not running or switched off."));
+    const QCommandLineOption json(QStringLiteral("json"), QStringLiteral("With --status: one JSON object."));
+    const QCommandLineOption checkConfig(QStringLiteral("check-config"),
+        QStringLiteral("Check the settings file (or FILE). Exit status 0 clean, 1 warnings, 2 errors."));
+    parser.addOptions({ status, json, checkConfig });
+    parser.addPositionalArgument(QStringLiteral("ACCOUNT|FILE"),
+        QStringLiteral("The account for --status, the file for --check-config."), QStringLiteral("[ACCOUNT|FILE]"));
     parser.process(app);
+    if (parser.isSet(checkConfig))
+        return runCheckConfig(parser.positionalArguments());
+    if (parser.isSet(status))
+        return runStatus(app, parser.positionalArguments().value(0), parser.isSet(json));
 
     for (const auto &command : commands) {
         if (!parser.isSet(command.second))

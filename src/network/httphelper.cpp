@@ -1,5 +1,6 @@
 #include "httphelper.h"
 
+#include "clientcredentials.h"
 #include "globalsetting.h"
 #include "kestpaths.h"
 #include "serverreachability.h"
@@ -139,7 +140,7 @@ bool HttpHelper::checkServerAddress(QString &hostPort, const std::atomic<bool> *
 {
     const SettingsFile::OneLook settingsOnce;
     if (!SettingsFile::exists()) {
-        warn(QStringLiteral("configuration file is broken."));
+        SettingsFile::warnOncePerVersion(QStringLiteral("configuration file is broken."));
         return false;
     }
     const GlobalSetting *settings = GlobalSetting::instance();
@@ -162,11 +163,27 @@ bool HttpHelper::checkServerAddress(QString &hostPort, const std::atomic<bool> *
         m_reachability->markUnreachable(hostPort, detail);
         return false;
     }
+    if (settings->protocol() == QLatin1String("https://")) {
+        refreshTls(isLiteralAddress(settings->ip()));
+        if (!m_clientProblem.isEmpty()) {
+            m_reachability->markUnreachable(hostPort, m_clientProblem);
+            return false;
+        }
+    }
     m_reachability->markReachable();
     return true;
 }
 
 bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configuration)
+{
+    refreshTls(literalAddress);
+    if (!m_tlsOwnAuthorities)
+        warn(QStringLiteral("cannot set server key."));
+    configuration = m_tlsConfiguration;
+    return m_tlsUsable;
+}
+
+void HttpHelper::refreshTls(bool literalAddress)
 {
     const GlobalSetting *settings = GlobalSetting::instance();
     const QString caPath = settings->serverCert();
@@ -176,37 +193,32 @@ bool HttpHelper::configureSsl(bool literalAddress, QSslConfiguration &configurat
     QVector<FileVersion> versions;
     for (const QString &path : paths)
         versions.append(FileVersion::of(path));
-    if (!m_tlsSettled || paths != m_tlsPaths || versions != m_tlsVersions || literalAddress != m_tlsLiteral) {
-        m_tlsPaths = paths;
-        m_tlsVersions = versions;
-        m_tlsLiteral = literalAddress;
-        m_tlsSettled
-            = std::all_of(versions.cbegin(), versions.cend(), [](const FileVersion &v) { return v.isSettled(); });
-        ++m_tlsGeneration;
-        m_tlsConfiguration = QSslConfiguration::defaultConfiguration();
-        m_tlsConfiguration.setPeerVerifyMode(QSslSocket::VerifyPeer);
-        m_tlsConfiguration.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
-        // Exactly the configured authorities: the system's store would let any public CA vouch for an impostor.
-        const QList<QSslCertificate> authorities = certificatesIn(caPath);
-        m_tlsOwnAuthorities = !authorities.isEmpty();
-        m_tlsUsable = m_tlsOwnAuthorities || !literalAddress;
-        if (m_tlsOwnAuthorities)
-            m_tlsConfiguration.setCaCertificates(authorities);
-        const QList<QSslCertificate> chain = certificatesIn(chainPath);
-        if (chain.isEmpty())
-            warn(QStringLiteral("cannot set local public key."));
-        else
-            m_tlsConfiguration.setLocalCertificateChain(chain);
-        QFile keyFile(keyPath);
-        if (keyPath.isEmpty() || !keyFile.open(QIODevice::ReadOnly))
-            warn(QStringLiteral("cannot read local private key."));
-        else
-            m_tlsConfiguration.setPrivateKey(QSslKey(&keyFile, QSsl::Rsa, QSsl::Pem, QSsl::PrivateKey));
-    }
-    if (!m_tlsOwnAuthorities)
-        warn(QStringLiteral("cannot set server key."));
-    configuration = m_tlsConfiguration;
-    return m_tlsUsable;
+    if (m_tlsSettled && paths == m_tlsPaths && versions == m_tlsVersions && literalAddress == m_tlsLiteral)
+        return;
+    m_tlsPaths = paths;
+    m_tlsVersions = versions;
+    m_tlsLiteral = literalAddress;
+    m_tlsSettled = std::all_of(versions.cbegin(), versions.cend(), [](const FileVersion &v) { return v.isSettled(); });
+    ++m_tlsGeneration;
+    m_tlsConfiguration = QSslConfiguration::defaultConfiguration();
+    m_tlsConfiguration.setPeerVerifyMode(QSslSocket::VerifyPeer);
+    m_tlsConfiguration.setSslOption(QSsl::SslOptionDisableSessionPersistence, false);
+    // Exactly the configured authorities: the system's store would let any public CA vouch for an impostor.
+    const QList<QSslCertificate> authorities = certificatesIn(caPath);
+    m_tlsOwnAuthorities = !authorities.isEmpty();
+    m_tlsUsable = m_tlsOwnAuthorities || !literalAddress;
+    if (m_tlsOwnAuthorities)
+        m_tlsConfiguration.setCaCertificates(authorities);
+    const ClientCredentials credentials = ClientCredentials::load(chainPath, keyPath);
+    m_clientProblem = credentials.problem();
+    if (credentials.chain().isEmpty())
+        warn(QStringLiteral("cannot set local public key."));
+    else
+        m_tlsConfiguration.setLocalCertificateChain(credentials.chain());
+    if (!ClientCredentials::unreadableReason(keyPath).isEmpty())
+        warn(QStringLiteral("cannot read local private key."));
+    else
+        m_tlsConfiguration.setPrivateKey(credentials.key());
 }
 
 bool HttpHelper::resolveTarget(Target &target)
@@ -224,6 +236,11 @@ bool HttpHelper::resolveTarget(Target &target)
     QSslConfiguration configuration;
     if (target.endpoint.tls && !configureSsl(literal, configuration))
         return false;
+    // Without its own certificate and key the client would only be refused: treated as an outage instead.
+    if (target.endpoint.tls && !m_clientProblem.isEmpty()) {
+        m_reachability->markUnreachable(target.hostPort, m_clientProblem);
+        return false;
+    }
     target.endpoint.tlsGeneration = target.endpoint.tls ? m_tlsGeneration : 0;
     m_connection.setEndpoint(target.endpoint, configuration);
     return true;
@@ -286,7 +303,7 @@ bool HttpHelper::exchange(
     failure = unreachableReply();
     m_lastAnswered = false;
     if (!SettingsFile::exists()) {
-        warn(QStringLiteral("configuration file is broken."));
+        SettingsFile::warnOncePerVersion(QStringLiteral("configuration file is broken."));
         return false;
     }
     if (m_reachability->isUnreachable())
@@ -298,6 +315,8 @@ bool HttpHelper::exchange(
     const QString url = settings->protocol() + target.hostPort + (settings->*path)();
     const DomainExchange reply = sendRequest(url, method, body());
     m_lastAnswered = reply.status != 0;
+    if (m_lastAnswered)
+        m_reachability->noteContact();
     if (!reply.connected) {
         m_reachability->markUnreachable(target.hostPort, reply.connectError);
         return false;

@@ -74,6 +74,8 @@ private:
     };
 
     bool resolveTarget(Target &target);
+    // Builds the TLS configuration again when the files or the address form changed.
+    void refreshTls(bool literalAddress);
     QDeadlineTimer requestDeadline(int milliseconds) const;
     bool exchange(
         PathSetting path, const QByteArray &method, const BodyBuilder &body, QJsonObject &object, QString &failure);
@@ -91,6 +93,7 @@ private:
     QSslConfiguration m_tlsConfiguration;
     bool m_tlsUsable = false;
     bool m_tlsOwnAuthorities = false;
+    QString m_clientProblem; // why the client certificate or key cannot be used, naming the file; empty when it can
     bool m_lastAnswered = false;
     QDeadlineTimer m_callDeadline { QDeadlineTimer::Forever };
 };

@@ -58,7 +58,7 @@ QString GlobalSetting::readExistingPath(const QString &key, const QString &warni
 {
     const QString path = readString(urlGroup, key, QString());
     if (!QFile::exists(path))
-        qWarning().noquote() << warning + path;
+        SettingsFile::warnOncePerVersion(warning + path);
     return path;
 }
 

@@ -3,7 +3,9 @@
 #include "fileversion.h"
 #include "kestpaths.h"
 
+#include <QDebug>
 #include <QHash>
+#include <QSet>
 #include <QSettings>
 
 #include <mutex>
@@ -17,6 +19,10 @@ struct Cache {
     bool loaded = false;
     bool settled = false; // the file had settled when it was parsed: an unchanged version means unchanged values
     QHash<QString, QVariant> values;
+    // What was already told about the version in hand.
+    QString warnedPath;
+    FileVersion warnedVersion;
+    QSet<QString> warned;
 };
 
 Cache &cache()
@@ -75,4 +81,22 @@ SettingsFile::OneLook::OneLook()
 SettingsFile::OneLook::~OneLook()
 {
     --oneLookDepth;
+}
+
+void SettingsFile::warnOncePerVersion(const QString &text)
+{
+    {
+        Cache &settings = cache();
+        std::lock_guard<std::mutex> lock(settings.mutex);
+        refresh(settings);
+        if (!(settings.warnedVersion == settings.version) || settings.warnedPath != settings.path) {
+            settings.warnedVersion = settings.version;
+            settings.warnedPath = settings.path;
+            settings.warned.clear();
+        }
+        if (settings.warned.contains(text))
+            return;
+        settings.warned.insert(text);
+    }
+    qWarning().noquote() << text;
 }

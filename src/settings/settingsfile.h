@@ -12,6 +12,8 @@ public:
     // As QSettings in INI form reads "group/key", default included.
     static QVariant value(const QString &group, const QString &key, const QVariant &defaultValue = QVariant());
     static bool exists();
+    // Logs a warning about the settings once per version of the file, not at every read.
+    static void warnOncePerVersion(const QString &text);
 
     // While one lives on a thread, that thread looks at the file once: one request answered under one
     // version of the settings, for the price of one stat.

@@ -7,6 +7,7 @@
 #include "testroot.h"
 
 #include <QDateTime>
+#include <QElapsedTimer>
 #include <QFile>
 #include <QTcpServer>
 #include <QTest>
@@ -260,9 +261,14 @@ private Q_SLOTS:
         row("host name", 6, QStringLiteral("main/ip=localhost"), "server:server 127.0.0.1", domainReply, 1);
         row("host name the certificate lacks", 6, QStringLiteral("main/ip=localhost"), "server:nosan 127.0.0.1",
             unreachable, 0);
-        // The server then refuses the handshake.
+        // A client that cannot show its own certificate would only be refused: it counts as an outage instead.
         row("neither client certificate nor key", 6, QStringLiteral("url/public-key\nurl/private-key=") + missing, "",
-            refused, 0);
+            unreachable, 0);
+        row("client key missing", 6, QStringLiteral("url/private-key=") + missing, "", unreachable, 0);
+        row("client key of another certificate", 6,
+            QStringLiteral("url/private-key=") + m_other.filePath(QStringLiteral("client.key")), "", unreachable, 0);
+        row("client certificate file holds a key", 6,
+            QStringLiteral("url/public-key=") + m_server.filePath(QStringLiteral("client.key")), "", unreachable, 0);
         row("plain HTTP", 0, QStringLiteral("url/protocol=http://\nurl/server-cert\nurl/public-key\nurl/private-key"),
             "server:plain", alice.arg(QLatin1String("@alice")), 1);
     }
@@ -337,6 +343,28 @@ private Q_SLOTS:
         QCOMPARE(helper.queryDomain(), unreachable);
         QVERIFY(m_server.requests().isEmpty());
         QString hostPort;
+        QVERIFY(helper.checkServerAddress(hostPort));
+        QCOMPARE(helper.queryDomain(), domainReply);
+    }
+
+    // A missing client key is told once for the outage, naming the file, and the probe keeps the outage until the
+    // key is back; no call waits on the network meanwhile.
+    void clientKeyOutageToldOnce()
+    {
+        const QString missing = m_other.filePath(QStringLiteral("missing.key"));
+        QVERIFY(writeSettings(QStringLiteral("url/private-key=") + missing));
+        HttpHelper helper;
+        QString hostPort;
+        QElapsedTimer timer;
+        timer.start();
+        for (int i = 0; i < 5; ++i)
+            QCOMPARE(helper.queryDomain(), unreachable);
+        QVERIFY(!helper.checkServerAddress(hostPort));
+        QVERIFY2(timer.elapsed() < 1000, qPrintable(QString::number(timer.elapsed())));
+        QCOMPARE(SyslogCapture::count("error host address: "), 1);
+        QCOMPARE(SyslogCapture::count("error detail: client private key file missing: " + missing.toUtf8()), 1);
+        QVERIFY(m_server.requests().isEmpty());
+        QVERIFY(writeSettings());
         QVERIFY(helper.checkServerAddress(hostPort));
         QCOMPARE(helper.queryDomain(), domainReply);
     }

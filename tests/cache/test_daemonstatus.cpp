@@ -1,0 +1,175 @@
+#include "cachedaemonfixture.h"
+#include "domainserverfixture.h"
+#include "testroot.h"
+
+#include <QElapsedTimer>
+#include <QJsonArray>
+#include <QJsonDocument>
+#include <QJsonObject>
+#include <QTest>
+
+namespace
+{
+struct Run {
+    int status = -1;
+    QByteArray out;
+    QByteArray err;
+    QJsonObject json() const { return QJsonDocument::fromJson(out).object(); }
+};
+
+// The command line, as root or under another uid.
+Run run(const QStringList &arguments, uint uid = 0)
+{
+    QProcess client;
+    if (uid == 0)
+        client.start(CacheDaemonFixture::programPath(), arguments);
+    else
+        client.start(QStringLiteral("setpriv"),
+            QStringList { QStringLiteral("--reuid=%1").arg(uid), QStringLiteral("--regid=%1").arg(uid),
+                QStringLiteral("--clear-groups"), CacheDaemonFixture::programPath() }
+                + arguments);
+    Run result;
+    if (client.waitForFinished(60000) && client.exitStatus() == QProcess::NormalExit)
+        result.status = client.exitCode();
+    result.out = client.readAllStandardOutput();
+    result.err = client.readAllStandardError();
+    return result;
+}
+
+Run status(const QStringList &more = {}, uint uid = 0)
+{
+    return run(QStringList { QStringLiteral("--status") } + more, uid);
+}
+} // namespace
+
+// What an administrator asks the running daemon: its state online, offline and switched off, in words and as
+// JSON, and only what the asking user may see. A client key gone missing is an outage answered from the cache
+// at once; a port that is none stops the daemon before it listens.
+class DaemonStatusTest : public QObject
+{
+    Q_OBJECT
+    TestRoot m_root;
+    DomainServerFixture m_server;
+    CacheDaemonFixture m_daemon;
+
+    bool writeSettings(const QVariantMap &overrides = {})
+    {
+        QVariantMap values { { QStringLiteral("main/enable"), true }, { QStringLiteral("main/network-timeout"), 2 },
+            { QStringLiteral("offline_login/enable"), true }, { QStringLiteral("offline_login/cache_validity"), 1 } };
+        for (auto it = overrides.cbegin(); it != overrides.cend(); ++it)
+            values.insert(it.key(), it.value());
+        return m_root.writeSettings(m_server.settingsIni(values));
+    }
+    QByteArray login() const
+    {
+        return m_daemon.call(
+            QStringLiteral("authenticatePassword"), { QStringLiteral("@alice"), QStringLiteral("alice-password") });
+    }
+
+private Q_SLOTS:
+    void initTestCase()
+    {
+        QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
+        // Other users' clients find the daemon through its pid file, as on a machine.
+        QVERIFY(QFile::setPermissions(m_root.filePath(QString()),
+            QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ExeOwner | QFileDevice::ReadOther
+                | QFileDevice::ExeOther));
+        QVERIFY(writeSettings());
+        QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+        QTRY_COMPARE_WITH_TIMEOUT(status().status, 0, 15000);
+        QCOMPARE(login(), QByteArray(R"({"pass":true})"));
+    }
+
+    void online()
+    {
+        const Run json = status({ QStringLiteral("--json") });
+        QCOMPARE(json.status, 0);
+        const QJsonObject state = json.json();
+        const QJsonObject server { { QStringLiteral("address"), DomainServerFixture::address() },
+            { QStringLiteral("port"), m_server.port() } };
+        QCOMPARE(state.value(QLatin1String("server")).toObject(), server);
+        QCOMPARE(state.value(QLatin1String("state")).toString(), QStringLiteral("online"));
+        QVERIFY(state.value(QLatin1String("lastContact")).isString() && state.value(QLatin1String("since")).isString());
+        QCOMPARE(state.value(QLatin1String("cachedAccounts")).toInt(), 1);
+        const QJsonObject alice = state.value(QLatin1String("accounts")).toArray().at(0).toObject();
+        QCOMPARE(alice.value(QLatin1String("name")).toString(), QStringLiteral("@alice"));
+        QCOMPARE(alice.value(QLatin1String("home")).toString(), QStringLiteral("/home/alice"));
+        QVERIFY(alice.value(QLatin1String("lastOnlineLogin")).isString());
+        QCOMPARE(alice.value(QLatin1String("offlineLogin")).toObject().value(QLatin1String("allowed")), true);
+        // Never the digest kept for offline logins.
+        QVERIFY2(!json.out.contains("password") && !json.out.contains("3b6"), json.out);
+
+        const Run text = status({ QStringLiteral("10001") });
+        QCOMPARE(text.status, 0);
+        for (const char *line : { "enabled:            yes\n", "state:              online since ",
+                 "cached accounts:    1\n", "account:            @alice (uid 10001)\n",
+                 "  offline login:    allowed until ", "  home:             /home/alice\n" })
+            QVERIFY2(text.out.contains(line), text.out);
+    }
+
+    // Anyone sees the general state, a user their own account, nobody another's.
+    void leastPrivilege()
+    {
+        const Run nobody = status({ QStringLiteral("--json") }, 65534);
+        QCOMPARE(nobody.status, 0);
+        QCOMPARE(nobody.json().value(QLatin1String("accounts")).toArray().size(), 0);
+        QCOMPARE(nobody.json().value(QLatin1String("cachedAccounts")).toInt(), 1);
+        const Run prying = status({ QStringLiteral("@alice") }, 65534);
+        QCOMPARE(prying.status, 1);
+        QCOMPARE(prying.err, QByteArray("permission denied !!!\n"));
+        const Run own = status({ QStringLiteral("--json"), QStringLiteral("@alice") }, 10001);
+        QCOMPARE(own.json().value(QLatin1String("accounts")).toArray().size(), 1);
+    }
+
+    // Without its key the client sends nothing and answers from the cache at once, not after the server's
+    // time-out; the status says why it is offline.
+    void missingClientKeyIsAnOutage()
+    {
+        const QString missing = m_server.filePath(QStringLiteral("gone.key"));
+        QVERIFY(writeSettings({ { QStringLiteral("url/private-key"), missing } }));
+        QVERIFY(m_server.clearRequests());
+        QElapsedTimer timer;
+        timer.start();
+        QCOMPARE(login(), QByteArray(R"({"pass":true})"));
+        QVERIFY2(timer.elapsed() < 1000, qPrintable(QString::number(timer.elapsed())));
+        QVERIFY(m_server.requests().isEmpty());
+
+        const Run json = status({ QStringLiteral("--json") });
+        QCOMPARE(json.status, 1);
+        QCOMPARE(json.json().value(QLatin1String("state")).toString(), QStringLiteral("offline"));
+        QVERIFY2(json.json().value(QLatin1String("reason")).toString().contains(missing), json.out);
+        QVERIFY2(status().out.contains("state:              offline since "), status().out);
+        QVERIFY(writeSettings());
+        QTRY_COMPARE_WITH_TIMEOUT(status().status, 0, 10000);
+    }
+
+    void disabledAndStopped()
+    {
+        QVERIFY(writeSettings({ { QStringLiteral("main/enable"), false } }));
+        const Run text = status();
+        QCOMPARE(text.status, 2);
+        QVERIFY2(text.out.startsWith("enabled:            no\n"), text.out);
+        QCOMPARE(status({ QStringLiteral("--json") }).json().value(QLatin1String("enabled")), false);
+        QCOMPARE(m_daemon.stop(), 0);
+        const Run stopped = status({ QStringLiteral("--json") });
+        QCOMPARE(stopped.status, 2);
+        QCOMPARE(stopped.out, QByteArray("{\"running\":false}\n"));
+    }
+
+    // Never a random port: the daemon names the key, the value and the file, and stops with a status of its own.
+    void invalidPortStopsTheDaemon()
+    {
+        QVERIFY(writeSettings({ { QStringLiteral("main/port"), QStringLiteral("10o80") } }));
+        const Run daemon = run({});
+        QCOMPARE(daemon.status, 3);
+        QVERIFY2(daemon.err.contains("configuration error: [main] port: \"10o80\" is not a whole number in 1-65535 in "
+                     + m_root.filePath(QStringLiteral("/etc/kest-iam.conf")).toUtf8()),
+            daemon.err);
+        const Run check = run({ QStringLiteral("--check-config") });
+        QCOMPARE(check.status, 2);
+        QVERIFY2(check.out.contains(": error: [main] port: \"10o80\""), check.out);
+    }
+};
+
+QTEST_GUILESS_MAIN(DaemonStatusTest)
+#include "test_daemonstatus.moc"
