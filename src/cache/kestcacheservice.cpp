@@ -139,6 +139,7 @@ void KestCacheService::onUpdateCache()
     }
     m_http->setCallDeadline(QDeadlineTimer(QDeadlineTimer::Forever));
     m_users->rebuildUsers(m_http.get());
+    Q_EMIT accountsWritten();
 }
 
 bool KestCacheService::isEnabled() const
@@ -207,6 +208,8 @@ QString KestCacheService::answerLookup(
     if (!name.startsWith(QLatin1Char('@')))
         user.insert(QStringLiteral("name"), QLatin1Char('@') + name);
     m_users->addUser(user);
+    m_unknown.forget(user.value(QLatin1String("name")).toString(), uint(user.value(QLatin1String("uid")).toDouble()));
+    Q_EMIT accountsWritten();
     return passReply(true);
 }
 
@@ -214,8 +217,12 @@ QString KestCacheService::queryAccountName(QString name)
 {
     if (!isEnabled())
         return passReply(false);
+    if (m_unknown.holds(name))
+        return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByName(name);
+    if (reply == HttpHelper::unknownAccountReply())
+        m_unknown.remember(name);
     return answerLookup(reply, m_users->hasUserName(name),
         QStringLiteral("offline cache doesnot persist account name: ") + name,
         QStringLiteral("web server doesnot have account name: ") + name);
@@ -225,8 +232,12 @@ QString KestCacheService::queryUid(uint uid)
 {
     if (!isEnabled())
         return passReply(false);
+    if (m_unknown.holds(uid))
+        return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByUid(uid);
+    if (reply == HttpHelper::unknownAccountReply())
+        m_unknown.remember(uid);
     const QString id = QString::number(uid);
     return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
         QStringLiteral("web server doesnot have account uid: ") + id);
@@ -257,6 +268,7 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
             "password should not be x because linux use it to express encrypted password meaning.");
         return passReply(false);
     }
+    m_unknown.forget(username);
     beginCall();
     const QString reply = m_http->authenticate(username, password, QStringLiteral("password"));
     if (reply == HttpHelper::unreachableReply()) {
@@ -286,6 +298,8 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
     }
     m_users->addUser(user);
     m_users->recordLogin(username);
+    m_unknown.forget(username, uint(user.value(QLatin1String("uid")).toDouble()));
+    Q_EMIT accountsWritten();
     HomeDirectoryRepair::repair(username, *m_users);
     return passReply(true);
 }
@@ -327,6 +341,7 @@ QString KestCacheService::modifyUser(QString json)
         qWarning().noquote() << QStringLiteral("web server successed, but lost user detail information");
     else
         m_users->addUser(user);
+    Q_EMIT accountsWritten();
     return reply;
 }
 

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "negativeanswers.h"
+
 #include <QJsonObject>
 #include <QObject>
 #include <QString>
@@ -44,6 +46,8 @@ public:
 
 Q_SIGNALS:
     void updateCache();
+    // A cache record or the group list was written: the account map is to show it before the reply goes.
+    void accountsWritten();
 
 public Q_SLOTS:
     QString queryAccountName(QString name);
@@ -75,4 +79,5 @@ private:
     std::mutex m_workerMutex;
     std::condition_variable m_workerWake;
     std::atomic<bool> m_stopWorker { false };
+    NegativeAnswers m_unknown;
 };

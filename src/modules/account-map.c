@@ -120,8 +120,8 @@ static int group_has_gid(const struct kest_map_view *view, const void *record, c
 static struct map_index account_index(const struct kest_map_view *view, uint32_t offset)
 {
     const struct kest_map_header *h = &view->header;
-    struct map_index index = { h->account_slots, offset, h->account_count, h->accounts,
-        sizeof(struct kest_map_account) };
+    struct map_index index
+        = { h->account_slots, offset, h->account_count, h->accounts, sizeof(struct kest_map_account) };
     return index;
 }
 
@@ -155,8 +155,8 @@ enum kest_map_result kest_map_member_by_name(
     const struct kest_map_view *view, const char *name, struct kest_map_member *out)
 {
     const struct kest_map_header *h = &view->header;
-    const struct map_index index = { h->member_slots, h->member_names, h->member_count, h->members,
-        sizeof(struct kest_map_member) };
+    const struct map_index index
+        = { h->member_slots, h->member_names, h->member_count, h->members, sizeof(struct kest_map_member) };
     return probe(view, &index, name_hash(name), member_has_name, name, out);
 }
 

@@ -268,8 +268,7 @@ static enum kest_map_result group_of_gid(const struct kest_map_view *view, void 
 }
 
 /* The daemon's map holds the group list as it was published; without one, the file itself is read. */
-static enum nss_status map_or_file(
-    kest_map_use from_map, struct group_query *query, group_match match, const void *key)
+static enum nss_status map_or_file(kest_map_use from_map, struct group_query *query, group_match match, const void *key)
 {
     enum kest_map_result mapped = kest_map_file_use(from_map, query);
     if (mapped == KEST_MAP_FOUND)
@@ -405,8 +404,7 @@ static enum kest_map_result add_member_groups(const struct kest_map_view *view, 
         uint32_t gid = 0;
         kest_map_id(view, member.first_id, i, &gid);
         if (gid != query->group)
-            query->status
-                = add_group(gid, query->start, query->size, query->groupsp, query->limit, query->errnop);
+            query->status = add_group(gid, query->start, query->size, query->groupsp, query->limit, query->errnop);
     }
     return KEST_MAP_FOUND;
 }

@@ -107,8 +107,7 @@ static enum nss_status ask_daemon(struct passwd_query *query)
         return status;
     if (!ask(port, query))
         return nss_not_found(query->errnop);
-    return read_entry(
-        port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
+    return read_entry(port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
 }
 
 static enum kest_map_result copy_account(
@@ -163,8 +162,7 @@ static enum nss_status look_up(kest_map_use from_map, struct passwd_query *query
         return nss_not_found(query->errnop);
     if (kest_map_file_use(from_map, query) == KEST_MAP_FOUND)
         return query->status;
-    return read_entry(
-        port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
+    return read_entry(port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
 }
 
 enum nss_status _nss_kest_getpwnam_r(const char *name, struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
@@ -172,8 +170,8 @@ enum nss_status _nss_kest_getpwnam_r(const char *name, struct passwd *pwd, char 
     /* Local accounts never pay for this module: no network name, no work at all. */
     if (name == NULL || name[0] != '@' || name[1] == '\0')
         return nss_not_found(errnop);
-    struct passwd_query query = { "getAccountByName", "queryAccountName", name, name, 0, pwd, buffer, buflen, errnop,
-        NSS_STATUS_NOTFOUND };
+    struct passwd_query query
+        = { "getAccountByName", "queryAccountName", name, name, 0, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
     return look_up(account_of_name, &query);
 }
 
@@ -183,8 +181,8 @@ enum nss_status _nss_kest_getpwuid_r(uid_t uid, struct passwd *pwd, char *buffer
         return nss_not_found(errnop);
     char text[UID_TEXT_SIZE];
     snprintf(text, sizeof(text), "%u", (unsigned int)uid);
-    struct passwd_query query = { "getAccountByUid", "queryUid", text, NULL, uid, pwd, buffer, buflen, errnop,
-        NSS_STATUS_NOTFOUND };
+    struct passwd_query query
+        = { "getAccountByUid", "queryUid", text, NULL, uid, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
     return look_up(account_of_uid, &query);
 }
 
