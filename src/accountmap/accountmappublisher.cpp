@@ -91,8 +91,8 @@ bool AccountMapPublisher::publish()
     if (now.exists() && !(now == m_publishedVersion))
         QFile::remove(path);
     QString error;
+    // A failed write is logged by the writer, and the last map stays in place.
     if (!WholeFile::write(path, bytes, mapPermissions, error)) {
-        qWarning().noquote() << QStringLiteral("cannot write the account map ") + path + QStringLiteral(": ") + error;
         m_published.clear();
         return false;
     }

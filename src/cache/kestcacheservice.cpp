@@ -53,6 +53,20 @@ void appendAccountEntry(QByteArray &out, const CacheControlInterface &record)
     out += ",\"uid\":" + QByteArray::number(record.uid()) + '}';
 }
 
+// The server's own "no such account": the fixed text, or an answer of the server's with a failure code and
+// no user. Refusals and outages are never taken for it.
+bool saysUnknown(const QString &reply)
+{
+    if (reply == HttpHelper::unknownAccountReply())
+        return true;
+    if (reply == HttpHelper::unreachableReply() || reply == HttpHelper::refusedReply())
+        return false;
+    const QJsonObject object = QJsonDocument::fromJson(reply.toUtf8()).object();
+    const QJsonValue code = object.value(QLatin1String("code"));
+    return code.isDouble() && code.toDouble() != 0
+        && !object.value(QLatin1String("data")).toObject().contains(QLatin1String("user"));
+}
+
 QString accountReply(const CacheControlPtr &record)
 {
     if (!record)
@@ -221,7 +235,7 @@ QString KestCacheService::queryAccountName(QString name)
         return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByName(name);
-    if (reply == HttpHelper::unknownAccountReply())
+    if (saysUnknown(reply))
         m_unknown.remember(name);
     return answerLookup(reply, m_users->hasUserName(name),
         QStringLiteral("offline cache doesnot persist account name: ") + name,
@@ -236,7 +250,7 @@ QString KestCacheService::queryUid(uint uid)
         return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByUid(uid);
-    if (reply == HttpHelper::unknownAccountReply())
+    if (saysUnknown(reply))
         m_unknown.remember(uid);
     const QString id = QString::number(uid);
     return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
