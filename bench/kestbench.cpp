@@ -1,5 +1,7 @@
 // kest-bench: latencies of cache-kest against floors measured in the same run, sample by sample (run by
 // tools/bench.sh).
+#include "accountmap.h"
+#include "accountmappublisher.h"
 #include "blackhole.h"
 #include "cachecontrolfactory.h"
 #include "cachecontrolinterface.h"
@@ -8,6 +10,7 @@
 #include "domainconnection.h"
 #include "domainserverfixture.h"
 #include "echoserver.h"
+#include "kestpaths.h"
 #include "logindstandin.h"
 #include "privatebus.h"
 #include "rawconnection.h"
@@ -21,6 +24,7 @@
 #include <QDateTime>
 #include <QElapsedTimer>
 #include <QFile>
+#include <QFileInfo>
 #include <QProcess>
 #include <QSslCertificate>
 #include <QSslKey>
@@ -36,6 +40,7 @@
 #include <utility>
 
 #include <dlfcn.h>
+#include <grp.h>
 #include <pwd.h>
 #include <sched.h>
 #include <unistd.h>
@@ -233,6 +238,102 @@ QList<Row> moduleRows(Floor &floor)
     return rows;
 }
 
+// The daemon's CPU time so far, in clock ticks.
+qint64 cpuTicksOf(qint64 pid)
+{
+    QFile stat(QStringLiteral("/proc/%1/stat").arg(pid));
+    if (!stat.open(QIODevice::ReadOnly))
+        return -1;
+    const QByteArray text = stat.readAll();
+    const QList<QByteArray> fields = text.mid(text.lastIndexOf(')') + 2).split(' ');
+    return fields.size() > 12 ? fields.at(11).toLongLong() + fields.at(12).toLongLong() : -1;
+}
+
+// The look-ups the account map answers, through the module as glibc calls it; prefix names the daemon's state.
+QList<Row> mapRows(const QString &prefix, Floor &floor, qint64 daemonPid, QStringList &notes)
+{
+    using GetPwNam = int (*)(const char *, passwd *, char *, size_t, int *);
+    using GetPwUid = int (*)(uid_t, passwd *, char *, size_t, int *);
+    using InitGroups = int (*)(const char *, gid_t, long *, long *, gid_t **, long, int *);
+    const QByteArray path = QFile::encodeName(
+        qEnvironmentVariable("KEST_TEST_BINARY_DIR") + QStringLiteral("/src/modules/libnss_kest.so.2"));
+    void *module = dlopen(path.constData(), RTLD_NOW | RTLD_LOCAL);
+    const auto getpwnam = module ? reinterpret_cast<GetPwNam>(dlsym(module, "_nss_kest_getpwnam_r")) : nullptr;
+    const auto getpwuid = module ? reinterpret_cast<GetPwUid>(dlsym(module, "_nss_kest_getpwuid_r")) : nullptr;
+    const auto initgroups = module ? reinterpret_cast<InitGroups>(dlsym(module, "_nss_kest_initgroups_dyn")) : nullptr;
+    if (!getpwnam || !getpwuid || !initgroups)
+        return {};
+    passwd entry;
+    char buffer[1024];
+    int error = 0;
+    const auto byName = [&](const char *name) { return getpwnam(name, &entry, buffer, sizeof(buffer), &error); };
+    const auto groupsOf = [&] {
+        long start = 0, size = 8;
+        auto *groups = static_cast<gid_t *>(malloc(size * sizeof(gid_t)));
+        initgroups("@alice", 10000, &start, &size, &groups, 0, &error);
+        free(groups);
+    };
+    // Ten calls a sample: one is near the timer's own cost.
+    const auto tenTimes = [](const std::function<void()> &action) {
+        return [action] {
+            for (int i = 0; i < 10; ++i)
+                action();
+        };
+    };
+    const qint64 ticksBefore = daemonPid > 0 ? cpuTicksOf(daemonPid) : 0;
+    QList<Row> rows;
+    rows << Row { prefix + QStringLiteral("getpwnam_r, cached account (per 10 calls)"),
+        measure(500, tenTimes([&] { byName("@alice"); }), &floor), floor.row.name };
+    if (daemonPid > 0) {
+        rows << Row { prefix + QStringLiteral("getpwuid_r, cached account (per 10 calls)"),
+            measure(500, tenTimes([&] { getpwuid(10001, &entry, buffer, sizeof(buffer), &error); }), &floor),
+            floor.row.name };
+        rows << Row { prefix + QStringLiteral("initgroups_dyn, cached account (per 10 calls)"),
+            measure(500, tenTimes(groupsOf), &floor), floor.row.name };
+        notes << prefix
+                + QStringLiteral("cache-kest CPU over 15,000 map look-ups: %1 clock ticks")
+                      .arg(cpuTicksOf(daemonPid) - ticksBefore);
+        byName("@nobody");
+        rows << Row { prefix + QStringLiteral("getpwnam_r, unknown name again within the negative time"),
+            measure(
+                200, [&] { byName("@nobody"); }, &floor),
+            floor.row.name };
+    }
+    dlclose(module);
+    return rows;
+}
+
+// The map of count accounts: its size, and the time to build it from the records and to write it.
+void mapScale(int count, QStringList &notes)
+{
+    AccountMap accounts;
+    for (int i = 0; i < count; ++i) {
+        const QByteArray name = "@user" + QByteArray::number(20000 + i);
+        accounts.addAccount({ quint32(20000 + i), 10000, name, "User", "/home/" + name, "/bin/bash" }, true);
+    }
+    QElapsedTimer timer;
+    timer.start();
+    const QByteArray bytes = accounts.toBytes();
+    const double layout = double(timer.nsecsElapsed()) / 1e6;
+    AccountMapPublisher publisher(nullptr);
+    timer.restart();
+    publisher.publish();
+    const double cold = double(timer.nsecsElapsed()) / 1e6;
+    QThread::msleep(200);
+    publisher.publish();
+    timer.restart();
+    publisher.publish();
+    const double warm = double(timer.nsecsElapsed()) / 1e6;
+    notes << QStringLiteral("account map of %1 accounts: %2 bytes; laid out in %3 ms; built from the records and "
+                            "written in %4 ms (records read), %5 ms (records unchanged since the last build)")
+                 .arg(count)
+                 .arg(QFileInfo(KestPaths::accountMapFile()).size())
+                 .arg(layout, 0, 'f', 1)
+                 .arg(cold, 0, 'f', 1)
+                 .arg(warm, 0, 'f', 1);
+    Q_UNUSED(bytes)
+}
+
 quint16 freePort()
 {
     QTcpServer probe;
@@ -313,6 +414,7 @@ QList<Row> scaleRows(int count, Floor &floor, QStringList &notes)
         + "\n[offline_login]\nenable=true\ncache_validity=30\n");
     if (!writeRecords(count, firstUid))
         return {};
+    mapScale(count, notes);
     const QList<quint32> listed = listCacheUids();
     const uint last = listed.isEmpty() ? firstUid : listed.last();
     QList<Row> rows = frontServiceRows(count, last, notes);
@@ -419,6 +521,16 @@ int main(int argc, char *argv[])
     rows << lookUpAndLogin(QStringLiteral("offline"), daemon.port(), lookUp, login, count, loopback);
     const QString rss = rssOf(daemon.processId());
     rows << moduleRows(loopback);
+    QStringList mapNotes;
+    server.start(server.port());
+    // The daemon counts the server out of reach since it stopped, until its next probe (once a second).
+    QThread::msleep(1500);
+    server.clearRequests();
+    rows << mapRows(QStringLiteral("map, daemon running: "), loopback, daemon.processId(), mapNotes);
+    mapNotes << QStringLiteral("requests reaching the domain server during the map rows: %1 (1: the first look-up "
+                               "of the unknown name alone)")
+                    .arg(server.requests().size());
+    server.stop();
 
     // A new outage per daemon start: the first call finds the server silent, the others know it.
     Row first { QStringLiteral("look-up, server blackholed: first call"), {}, loopback.row.name };
@@ -433,10 +545,12 @@ int main(int argc, char *argv[])
     }
     rows << first << following;
     daemon.stop();
+    rows << mapRows(QStringLiteral("map, daemon stopped: "), loopback, 0, mapNotes);
     QStringList notes { QStringLiteral("cache-kest RSS after the online and offline rows: ") + rss,
         QStringLiteral("blackholed first call: p50 %1 s over %2 daemon starts")
             .arg(percentile(first.samples, 0.5) / 1000, 0, 'f', 2)
             .arg(first.samples.size()) };
+    notes << mapNotes;
     for (const int count : { 1000, 10000 })
         rows << scaleRows(count, loopback, notes);
     rows.prepend(kept.row);

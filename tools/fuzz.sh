@@ -11,7 +11,7 @@ kest_ensure_packages clang libclang-rt-14-dev
 seconds=${1:-60}
 shift || true
 targets=("$@")
-[ ${#targets[@]} -eq 0 ] && targets=(fuzz_request fuzz_cacherecord fuzz_groups fuzz_domainreply fuzz_policy)
+[ ${#targets[@]} -eq 0 ] && targets=(fuzz_request fuzz_cacherecord fuzz_groups fuzz_domainreply fuzz_policy fuzz_accountmap)
 build="$top/build-fuzz"
 
 CC=clang CXX=clang++ cmake -S "$top" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKEST_FUZZ=ON >/dev/null

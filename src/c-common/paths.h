@@ -14,6 +14,8 @@ extern "C" {
 #define KEST_PATH_CACHE_PID "/run/cache-kest.pid"
 #define KEST_PATH_HOME "/home"
 #define KEST_PATH_MACHINE_ID "/usr/share/kest/machine.txt"
+/* The accounts cache-kest publishes for the name-service module (account-map-format.h). */
+#define KEST_PATH_ACCOUNT_MAP "/run/cache-kest.map"
 
 /* Environment variable naming a directory put in front of the paths above (tests only). */
 #define KEST_ROOT_ENV "KEST_IAM_ROOT"

@@ -55,6 +55,20 @@ void appendAccountEntry(QByteArray &out, const CacheControlInterface &record)
     out += ",\"uid\":" + QByteArray::number(record.uid()) + '}';
 }
 
+// The server's own "no such account": the fixed text, or an answer of the server's with a failure code and
+// no user. Refusals and outages are never taken for it.
+bool saysUnknown(const QString &reply)
+{
+    if (reply == HttpHelper::unknownAccountReply())
+        return true;
+    if (reply == HttpHelper::unreachableReply() || reply == HttpHelper::refusedReply())
+        return false;
+    const QJsonObject object = QJsonDocument::fromJson(reply.toUtf8()).object();
+    const QJsonValue code = object.value(QLatin1String("code"));
+    return code.isDouble() && code.toDouble() != 0
+        && !object.value(QLatin1String("data")).toObject().contains(QLatin1String("user"));
+}
+
 QString accountReply(const CacheControlPtr &record)
 {
     if (!record)
@@ -144,6 +158,7 @@ void KestCacheService::onUpdateCache()
     m_http->setCallDeadline(QDeadlineTimer(QDeadlineTimer::Forever));
     m_users->rebuildUsers(m_http.get());
     m_lastRefresh = QDateTime::currentSecsSinceEpoch();
+    Q_EMIT accountsWritten();
 }
 
 bool KestCacheService::isEnabled() const
@@ -222,15 +237,24 @@ QString KestCacheService::answerLookup(
     const QString name = user.value(QLatin1String("name")).toString();
     if (!name.startsWith(QLatin1Char('@')))
         user.insert(QStringLiteral("name"), QLatin1Char('@') + name);
-    return passReply(m_users->addUser(user) != UserListManager::Added::Refused);
+    const UserListManager::Added added = m_users->addUser(user);
+    if (added == UserListManager::Added::Refused)
+        return passReply(false);
+    m_unknown.forget(user.value(QLatin1String("name")).toString(), uint(user.value(QLatin1String("uid")).toDouble()));
+    Q_EMIT accountsWritten();
+    return passReply(true);
 }
 
 QString KestCacheService::queryAccountName(QString name)
 {
     if (!isEnabled())
         return passReply(false);
+    if (m_unknown.holds(name))
+        return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByName(name);
+    if (saysUnknown(reply))
+        m_unknown.remember(name);
     return answerLookup(reply, m_users->hasUserName(name),
         QStringLiteral("offline cache doesnot persist account name: ") + name,
         QStringLiteral("web server doesnot have account name: ") + name);
@@ -240,8 +264,12 @@ QString KestCacheService::queryUid(uint uid)
 {
     if (!isEnabled())
         return passReply(false);
+    if (m_unknown.holds(uid))
+        return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByUid(uid);
+    if (saysUnknown(reply))
+        m_unknown.remember(uid);
     const QString id = QString::number(uid);
     return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
         QStringLiteral("web server doesnot have account uid: ") + id);
@@ -272,6 +300,7 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
             "password should not be x because linux use it to express encrypted password meaning.");
         return passReply(false);
     }
+    m_unknown.forget(username);
     const uint uid = m_users->uidOfName(username);
     if (const qint64 until = m_throttle->lockedUntil(uid))
         return lockedReply(until);
@@ -323,6 +352,8 @@ QString KestCacheService::checkPassword(const QString &username, const QString &
         return passReply(false);
     if (added == UserListManager::Added::Written)
         m_users->recordLogin(username);
+    m_unknown.forget(username, uint(user.value(QLatin1String("uid")).toDouble()));
+    Q_EMIT accountsWritten();
     HomeDirectoryRepair::repair(username, *m_users);
     return passReply(true);
 }
@@ -372,6 +403,7 @@ QString KestCacheService::modifyUser(QString json)
         qWarning().noquote() << QStringLiteral("web server successed, but lost user detail information");
     else
         m_users->addUser(user);
+    Q_EMIT accountsWritten();
     return reply;
 }
 

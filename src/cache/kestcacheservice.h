@@ -1,5 +1,6 @@
 #pragma once
 
+#include "negativeanswers.h"
 #include "serverreachability.h"
 
 #include <QJsonObject>
@@ -54,6 +55,8 @@ public:
 
 Q_SIGNALS:
     void updateCache();
+    // A cache record or the group list was written: the account map is to show it before the reply goes.
+    void accountsWritten();
 
 public Q_SLOTS:
     QString queryAccountName(QString name);
@@ -91,4 +94,5 @@ private:
     std::atomic<bool> m_stopWorker { false };
     std::atomic<qint64> m_lastRefresh { 0 };
     qint64 m_startedAt;
+    NegativeAnswers m_unknown;
 };

@@ -1,4 +1,5 @@
 // Entry of cache-kest: the cache daemon without arguments, its command-line client with them.
+#include "accountmappublisher.h"
 #include "common.h"
 #include "globalsetting.h"
 #include "kestcacheclient.h"
@@ -82,6 +83,9 @@ int runDaemon(QCoreApplication &app)
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
+    AccountMapPublisher accountMap(service->userList());
+    QObject::connect(service, &KestCacheService::accountsWritten, &accountMap, &AccountMapPublisher::publish);
+    accountMap.publish();
     service->startWorker();
 
     const int result = app.exec();

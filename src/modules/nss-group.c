@@ -1,6 +1,7 @@
 /* nss-group.c - the group map of the name-service module: the daemon's public group list */
 #define _GNU_SOURCE
 #include "common.h"
+#include "map-file.h"
 #include "nss-buffer.h"
 #include "nss-listing.h"
 #include "paths.h"
@@ -203,16 +204,92 @@ static enum nss_status find_group(
     return status == NSS_STATUS_NOTFOUND ? nss_not_found(errnop) : status;
 }
 
+/* One look-up of a group in the daemon's map. */
+struct group_query {
+    const char *name;
+    gid_t gid;
+    struct group *grp;
+    char *buffer;
+    size_t buflen;
+    int *errnop;
+    enum nss_status status;
+};
+
+/* A run of the id area, as a record names it; 0 when it does not lie inside. */
+static int ids_inside(const struct kest_map_view *view, uint32_t first, uint32_t count)
+{
+    return (uint64_t)first + count <= view->header.id_count;
+}
+
+static enum kest_map_result copy_group(
+    const struct kest_map_view *view, const struct kest_map_group *found, struct group_query *query)
+{
+    const char *name = kest_map_text(view, found->name), *password = kest_map_text(view, found->password);
+    if (name == NULL || password == NULL || !ids_inside(view, found->first_id, found->id_count))
+        return KEST_MAP_BROKEN;
+    struct nss_buffer out;
+    nss_buffer_init(&out, query->buffer, query->buflen);
+    char **members = nss_buffer_pointers(&out, (size_t)found->id_count + 1);
+    query->grp->gr_name = nss_buffer_copy(&out, name, found->name.length);
+    query->grp->gr_passwd = nss_buffer_copy(&out, password, found->password.length);
+    query->grp->gr_gid = found->gid;
+    for (uint32_t i = 0; i < found->id_count; ++i) {
+        uint32_t index;
+        struct kest_map_member member;
+        const char *text;
+        if (!kest_map_id(view, found->first_id, i, &index) || kest_map_member_at(view, index, &member) != KEST_MAP_FOUND
+            || (text = kest_map_text(view, member.name)) == NULL)
+            return KEST_MAP_BROKEN;
+        char *copy = nss_buffer_copy(&out, text, member.name.length);
+        if (members != NULL)
+            members[i] = copy;
+    }
+    if (members != NULL)
+        members[found->id_count] = NULL;
+    query->grp->gr_mem = members;
+    query->status = nss_buffer_status(&out, query->errnop);
+    return KEST_MAP_FOUND;
+}
+
+static enum kest_map_result group_of_name(const struct kest_map_view *view, void *context)
+{
+    struct group_query *query = context;
+    struct kest_map_group found;
+    enum kest_map_result result = kest_map_group_by_name(view, query->name, &found);
+    return result == KEST_MAP_FOUND ? copy_group(view, &found, query) : result;
+}
+
+static enum kest_map_result group_of_gid(const struct kest_map_view *view, void *context)
+{
+    struct group_query *query = context;
+    struct kest_map_group found;
+    enum kest_map_result result = kest_map_group_by_gid(view, (uint32_t)query->gid, &found);
+    return result == KEST_MAP_FOUND ? copy_group(view, &found, query) : result;
+}
+
+/* The daemon's map holds the group list as it was published; without one, the file itself is read. */
+static enum nss_status map_or_file(kest_map_use from_map, struct group_query *query, group_match match, const void *key)
+{
+    enum kest_map_result mapped = kest_map_file_use(from_map, query);
+    if (mapped == KEST_MAP_FOUND)
+        return query->status;
+    if (mapped == KEST_MAP_MISSING)
+        return nss_not_found(query->errnop);
+    return find_group(match, key, query->grp, query->buffer, query->buflen, query->errnop);
+}
+
 enum nss_status _nss_kest_getgrnam_r(const char *name, struct group *grp, char *buffer, size_t buflen, int *errnop)
 {
     if (name == NULL || name[0] == '\0')
         return nss_not_found(errnop);
-    return find_group(has_name, name, grp, buffer, buflen, errnop);
+    struct group_query query = { name, 0, grp, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+    return map_or_file(group_of_name, &query, has_name, name);
 }
 
 enum nss_status _nss_kest_getgrgid_r(gid_t gid, struct group *grp, char *buffer, size_t buflen, int *errnop)
 {
-    return find_group(has_gid, &gid, grp, buffer, buflen, errnop);
+    struct group_query query = { NULL, gid, grp, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+    return map_or_file(group_of_gid, &query, has_gid, &gid);
 }
 
 static struct nss_listing group_walk = NSS_LISTING_INIT;
@@ -301,12 +378,46 @@ static enum nss_status add_group(
     return NSS_STATUS_SUCCESS;
 }
 
+/* One user's group list, as initgroups builds it. */
+struct member_query {
+    const char *user;
+    gid_t group;
+    long int *start;
+    long int *size;
+    gid_t **groupsp;
+    long int limit;
+    int *errnop;
+    enum nss_status status;
+};
+
+static enum kest_map_result add_member_groups(const struct kest_map_view *view, void *context)
+{
+    struct member_query *query = context;
+    struct kest_map_member member;
+    query->status = NSS_STATUS_SUCCESS;
+    enum kest_map_result result = kest_map_member_by_name(view, query->user, &member);
+    if (result != KEST_MAP_FOUND)
+        return result;
+    if (!ids_inside(view, member.first_id, member.id_count))
+        return KEST_MAP_BROKEN;
+    for (uint32_t i = 0; i < member.id_count && query->status == NSS_STATUS_SUCCESS; ++i) {
+        uint32_t gid = 0;
+        kest_map_id(view, member.first_id, i, &gid);
+        if (gid != query->group)
+            query->status = add_group(gid, query->start, query->size, query->groupsp, query->limit, query->errnop);
+    }
+    return KEST_MAP_FOUND;
+}
+
 enum nss_status _nss_kest_initgroups_dyn(
     const char *user, gid_t group, long int *start, long int *size, gid_t **groupsp, long int limit, int *errnop)
 {
     /* Only network accounts are listed here beyond what the machine's own groups hold. */
     if (user == NULL || user[0] != '@')
         return nss_not_found(errnop);
+    struct member_query query = { user, group, start, size, groupsp, limit, errnop, NSS_STATUS_SUCCESS };
+    if (kest_map_file_use(add_member_groups, &query) != KEST_MAP_BROKEN)
+        return query.status;
     char *text = read_group_file();
     if (text == NULL)
         return nss_unavailable(errnop);

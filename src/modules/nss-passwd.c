@@ -2,6 +2,7 @@
 #include "common.h"
 #include "daemon-client.h"
 #include "json-reader.h"
+#include "map-file.h"
 #include "nss-buffer.h"
 #include "nss-listing.h"
 
@@ -53,24 +54,13 @@ static enum nss_status fill_passwd(const char *user, struct passwd *pwd, char *b
     return status;
 }
 
-/* The cached entry; only when there is none, one query that lets the daemon ask the domain server,
- * then a second read of the entry. */
-static enum nss_status look_up(const char *read_function, const char *query_function, const char *key,
-    struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
+/* The daemon's entry for key, as read_function answers it. */
+static enum nss_status read_entry(unsigned short port, const char *read_function, const char *key, struct passwd *pwd,
+    char *buffer, size_t buflen, int *errnop)
 {
     char *reply = NULL;
-    const unsigned short port = kest_daemon_port();
     if (!kest_call(port, read_function, &key, 1, &reply))
         return nss_unavailable(errnop);
-    if (!kest_reply_passed(reply)) {
-        free(reply);
-        int known = kest_call(port, query_function, &key, 1, &reply) && kest_reply_passed(reply);
-        free(reply);
-        if (!known)
-            return nss_not_found(errnop);
-        if (!kest_call(port, read_function, &key, 1, &reply))
-            return nss_unavailable(errnop);
-    }
     enum nss_status status = kest_reply_passed(reply)
         ? fill_passwd(json_member(reply, "user"), pwd, buffer, buflen, errnop)
         : nss_not_found(errnop);
@@ -78,12 +68,111 @@ static enum nss_status look_up(const char *read_function, const char *query_func
     return status;
 }
 
+/* One look-up, whichever way it is answered. */
+struct passwd_query {
+    const char *read_function;
+    const char *query_function;
+    const char *key;
+    const char *name;
+    uid_t uid;
+    struct passwd *pwd;
+    char *buffer;
+    size_t buflen;
+    int *errnop;
+    enum nss_status status;
+};
+
+/* Lets the daemon ask the domain server; 1 when the account exists. */
+static int ask(unsigned short port, const struct passwd_query *query)
+{
+    char *reply = NULL;
+    int known = kest_call(port, query->query_function, &query->key, 1, &reply) && kest_reply_passed(reply);
+    free(reply);
+    return known;
+}
+
+/* Without a map: the cached entry; only when there is none, one query that lets the daemon ask the domain
+ * server, then a second read of the entry. */
+static enum nss_status ask_daemon(struct passwd_query *query)
+{
+    char *reply = NULL;
+    const unsigned short port = kest_daemon_port();
+    if (!kest_call(port, query->read_function, &query->key, 1, &reply))
+        return nss_unavailable(query->errnop);
+    enum nss_status status = NSS_STATUS_NOTFOUND;
+    if (kest_reply_passed(reply))
+        status = fill_passwd(json_member(reply, "user"), query->pwd, query->buffer, query->buflen, query->errnop);
+    free(reply);
+    if (status != NSS_STATUS_NOTFOUND)
+        return status;
+    if (!ask(port, query))
+        return nss_not_found(query->errnop);
+    return read_entry(port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
+}
+
+static enum kest_map_result copy_account(
+    const struct kest_map_view *view, const struct kest_map_account *account, struct passwd_query *query)
+{
+    const char *name = kest_map_text(view, account->name), *gecos = kest_map_text(view, account->gecos),
+               *home = kest_map_text(view, account->home), *shell = kest_map_text(view, account->shell);
+    if (name == NULL || gecos == NULL || home == NULL || shell == NULL || account->uid < FIRST_DOMAIN_UID)
+        return KEST_MAP_BROKEN;
+    struct nss_buffer out;
+    nss_buffer_init(&out, query->buffer, query->buflen);
+    query->pwd->pw_uid = account->uid;
+    query->pwd->pw_gid = account->gid;
+    query->pwd->pw_name = nss_buffer_copy(&out, name, account->name.length);
+    query->pwd->pw_passwd = nss_buffer_copy(&out, "x", 1);
+    query->pwd->pw_gecos = nss_buffer_copy(&out, gecos, account->gecos.length);
+    query->pwd->pw_dir = nss_buffer_copy(&out, home, account->home.length);
+    query->pwd->pw_shell = nss_buffer_copy(&out, shell, account->shell.length);
+    query->status = nss_buffer_status(&out, query->errnop);
+    return KEST_MAP_FOUND;
+}
+
+static enum kest_map_result account_of_name(const struct kest_map_view *view, void *context)
+{
+    struct passwd_query *query = context;
+    struct kest_map_account account;
+    enum kest_map_result result = kest_map_account_by_name(view, query->name, &account);
+    return result == KEST_MAP_FOUND ? copy_account(view, &account, query) : result;
+}
+
+static enum kest_map_result account_of_uid(const struct kest_map_view *view, void *context)
+{
+    struct passwd_query *query = context;
+    struct kest_map_account account;
+    enum kest_map_result result = kest_map_account_by_uid(view, (uint32_t)query->uid, &account);
+    return result == KEST_MAP_FOUND ? copy_account(view, &account, query) : result;
+}
+
+/* From the daemon's map when it holds the account. One it lacks is one the daemon has not cached: the
+ * daemon asks the domain server, and publishes what it learns before it answers. */
+static enum nss_status look_up(kest_map_use from_map, struct passwd_query *query)
+{
+    enum kest_map_result mapped = kest_map_file_use(from_map, query);
+    if (mapped == KEST_MAP_FOUND)
+        return query->status;
+    if (mapped == KEST_MAP_BROKEN)
+        return ask_daemon(query);
+    const unsigned short port = kest_daemon_port();
+    if (port == 0)
+        return nss_unavailable(query->errnop);
+    if (!ask(port, query))
+        return nss_not_found(query->errnop);
+    if (kest_map_file_use(from_map, query) == KEST_MAP_FOUND)
+        return query->status;
+    return read_entry(port, query->read_function, query->key, query->pwd, query->buffer, query->buflen, query->errnop);
+}
+
 enum nss_status _nss_kest_getpwnam_r(const char *name, struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
 {
     /* Local accounts never pay for this module: no network name, no work at all. */
     if (name == NULL || name[0] != '@' || name[1] == '\0')
         return nss_not_found(errnop);
-    return look_up("getAccountByName", "queryAccountName", name, pwd, buffer, buflen, errnop);
+    struct passwd_query query
+        = { "getAccountByName", "queryAccountName", name, name, 0, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+    return look_up(account_of_name, &query);
 }
 
 enum nss_status _nss_kest_getpwuid_r(uid_t uid, struct passwd *pwd, char *buffer, size_t buflen, int *errnop)
@@ -92,7 +181,9 @@ enum nss_status _nss_kest_getpwuid_r(uid_t uid, struct passwd *pwd, char *buffer
         return nss_not_found(errnop);
     char text[UID_TEXT_SIZE];
     snprintf(text, sizeof(text), "%u", (unsigned int)uid);
-    return look_up("getAccountByUid", "queryUid", text, pwd, buffer, buflen, errnop);
+    struct passwd_query query
+        = { "getAccountByUid", "queryUid", text, NULL, uid, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+    return look_up(account_of_uid, &query);
 }
 
 static struct nss_listing account_walk = NSS_LISTING_INIT;

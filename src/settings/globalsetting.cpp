@@ -206,3 +206,8 @@ bool GlobalSetting::isEnabled() const
 {
     return readBool(mainGroup, QStringLiteral("enable"), false);
 }
+
+int GlobalSetting::negativeCacheTimeout() const
+{
+    return readInt(mainGroup, QStringLiteral("negative-cache-timeout"), 15);
+}

@@ -35,6 +35,8 @@ public:
     int groupBufferLimit() const;
     bool isDebug() const;
     bool isEnabled() const;
+    // Seconds an answer "no such account" from the domain server stands; 0 or less: not kept.
+    int negativeCacheTimeout() const;
 
 private:
     friend struct GlobalSettingOwner;

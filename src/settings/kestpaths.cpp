@@ -68,3 +68,8 @@ QString KestPaths::machineIdFile()
 {
     return prefixed(KEST_PATH_MACHINE_ID);
 }
+
+QString KestPaths::accountMapFile()
+{
+    return prefixed(KEST_PATH_ACCOUNT_MAP);
+}

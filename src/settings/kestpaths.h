@@ -15,4 +15,5 @@ public:
     static QString cachePidFile();
     static QString homeRoot();
     static QString machineIdFile();
+    static QString accountMapFile();
 };

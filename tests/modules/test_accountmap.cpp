@@ -1,0 +1,262 @@
+#include "accountmap.h"
+#include "cachedaemonfixture.h"
+#include "domainserverfixture.h"
+#include "testroot.h"
+
+extern "C" {
+#include "account-map.h"
+}
+
+#include <QElapsedTimer>
+#include <QFileInfo>
+#include <QJsonArray>
+#include <QProcess>
+#include <QTest>
+
+#include <dlfcn.h>
+#include <grp.h>
+#include <nss.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+// The account map: its layout as the module reads it, then the module under glibc against the real
+// cache-kest and the test domain server, with the daemon running and stopped.
+class AccountMapTest : public QObject
+{
+    Q_OBJECT
+    void *m_nss = nullptr;
+    TestRoot m_root;
+    DomainServerFixture m_server;
+    CacheDaemonFixture m_daemon;
+
+    QString mapPath() const { return m_root.filePath(QStringLiteral("/run/cache-kest.map")); }
+    static QByteArray modulePath() { return qgetenv("KEST_TEST_BINARY_DIR") + "/src/modules/libnss_kest.so.2"; }
+    QByteArray settings(int negativeSeconds, bool enabled = true) const
+    {
+        return m_server.settingsIni({ { QStringLiteral("main/enable"), enabled },
+            { QStringLiteral("main/negative-cache-timeout"), negativeSeconds } });
+    }
+
+    template<typename... Arguments> nss_status (*entry_point(const char *name) const)(Arguments...)
+    {
+        return reinterpret_cast<nss_status (*)(Arguments...)>(dlsym(m_nss, name));
+    }
+    // "status entry" of one call of the loaded module: the entry as a passwd line or a gid list.
+    QByteArray call(const QByteArray &function, const QByteArray &key) const
+    {
+        char buffer[1024];
+        int error = 0, status;
+        passwd pwd {};
+        QByteArray entry;
+        if (function == "getpwnam" || function == "getpwuid") {
+            const bool byName = function == "getpwnam";
+            status = byName ? entry_point<const char *, passwd *, char *, size_t, int *>("_nss_kest_getpwnam_r")(
+                         key.constData(), &pwd, buffer, sizeof(buffer), &error)
+                            : entry_point<uid_t, passwd *, char *, size_t, int *>("_nss_kest_getpwuid_r")(
+                                uid_t(key.toUInt()), &pwd, buffer, sizeof(buffer), &error);
+            if (status == NSS_STATUS_SUCCESS)
+                entry = QByteArrayList({ pwd.pw_name, QByteArray::number(pwd.pw_uid), pwd.pw_gecos }).join(':');
+        } else {
+            long start = 0, size = 0;
+            gid_t *groups = nullptr;
+            status = entry_point<const char *, gid_t, long *, long *, gid_t **, long, int *>(
+                "_nss_kest_initgroups_dyn")(key.constData(), gid_t(10000), &start, &size, &groups, 0L, &error);
+            for (long i = 0; i < start; ++i)
+                entry += QByteArray::number(groups[i]) + ' ';
+            free(groups);
+        }
+        return (QByteArray::number(status) + ' ' + entry).trimmed();
+    }
+    int serverRequests() const { return m_server.requests().size(); }
+
+private Q_SLOTS:
+    void initTestCase()
+    {
+        m_nss = dlopen(modulePath().constData(), RTLD_NOW | RTLD_LOCAL);
+        QVERIFY2(m_nss, dlerror());
+        QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
+        QVERIFY(m_root.writeSettings(settings(2)));
+        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
+        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
+        QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+    }
+
+    void layout_data()
+    {
+        QTest::addColumn<QByteArray>("lookUp"); // kind and key
+        QTest::addColumn<QByteArray>("result"); // what was found, or "missing"
+        QTest::newRow("by name") << QByteArray("name @alice") << QByteArray("10001 10000 Alice /home/alice /bin/bash");
+        QTest::newRow("by uid") << QByteArray("uid 10002") << QByteArray("10002 10000 Bob /home/bob /bin/sh");
+        QTest::newRow("the first of a name")
+            << QByteArray("name @bob") << QByteArray("10002 10000 Bob /home/bob /bin/sh");
+        QTest::newRow("by uid only") << QByteArray("uid 10003") << QByteArray("10003 10000 Bob /b /bin/sh");
+        QTest::newRow("unknown name") << QByteArray("name @carol") << QByteArray("missing");
+        QTest::newRow("unknown uid") << QByteArray("uid 10004") << QByteArray("missing");
+        QTest::newRow("member's groups") << QByteArray("member @alice") << QByteArray("27 10000 5001");
+        QTest::newRow("group by name") << QByteArray("group kest") << QByteArray("10000 x @alice,@bob");
+        QTest::newRow("group by gid") << QByteArray("gid 27") << QByteArray("27 x admin,@alice,@alice");
+        QTest::newRow("line without a valid gid") << QByteArray("group broken") << QByteArray("missing");
+    }
+
+    void layout()
+    {
+        QFETCH(QByteArray, lookUp);
+        AccountMap map;
+        map.addAccount({ 10001, 10000, "@alice", "Alice", "/home/alice", "/bin/bash" }, true);
+        map.addAccount({ 10002, 10000, "@bob", "Bob", "/home/bob", "/bin/sh" }, true);
+        // A second record of the same name, which the user list gives to the first one.
+        map.addAccount({ 10003, 10000, "@bob", "Bob", "/b", "/bin/sh" }, false);
+        map.setGroupList("sudo:x:27:admin,@alice,@alice\nkest:x:10000:@alice,@bob\nbroken:x:0:@alice\n"
+                         "lpadmin:x:5001:@alice,\nsudo:x:28:@bob");
+        const QByteArray bytes = map.toBytes();
+        kest_map_view view;
+        QVERIFY(kest_map_view_init(&view, bytes.constData(), size_t(bytes.size())));
+        // Cut anywhere, the header no longer matches the size.
+        QVERIFY(!kest_map_view_init(&view, bytes.constData(), size_t(bytes.size() - 4)));
+        QVERIFY(kest_map_view_init(&view, bytes.constData(), size_t(bytes.size())));
+        const auto text = [&view](struct kest_map_text text) {
+            const char *bytes = kest_map_text(&view, text);
+            return bytes ? QByteArray(bytes, int(text.length)) : QByteArray("?");
+        };
+        const QByteArray kind = lookUp.split(' ').at(0), key = lookUp.split(' ').at(1);
+        QByteArrayList found;
+        kest_map_result result;
+        if (kind == "name" || kind == "uid") {
+            kest_map_account account {};
+            result = kind == "name" ? kest_map_account_by_name(&view, key.constData(), &account)
+                                    : kest_map_account_by_uid(&view, key.toUInt(), &account);
+            found = { QByteArray::number(account.uid), QByteArray::number(account.gid), text(account.gecos),
+                text(account.home), text(account.shell) };
+        } else if (kind == "member") {
+            kest_map_member member {};
+            result = kest_map_member_by_name(&view, key.constData(), &member);
+            for (uint32_t i = 0, gid = 0; i < member.id_count && kest_map_id(&view, member.first_id, i, &gid); ++i)
+                found << QByteArray::number(gid);
+        } else {
+            kest_map_group group {};
+            result = kind == "group" ? kest_map_group_by_name(&view, key.constData(), &group)
+                                     : kest_map_group_by_gid(&view, key.toUInt(), &group);
+            QByteArrayList members;
+            for (uint32_t i = 0, index = 0; i < group.id_count && kest_map_id(&view, group.first_id, i, &index); ++i) {
+                kest_map_member member {};
+                kest_map_member_at(&view, index, &member);
+                members << text(member.name);
+            }
+            found = { QByteArray::number(group.gid), text(group.password), members.join(',') };
+        }
+        QTEST(result == KEST_MAP_FOUND ? found.join(' ') : QByteArray("missing"), "result");
+    }
+
+    // A cached account is answered from the map, its groups too; an unknown one is asked for once in the
+    // negative time, and again after it.
+    void daemonRunning()
+    {
+        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+        QTRY_VERIFY(QFileInfo::exists(mapPath()));
+        struct stat map;
+        QCOMPARE(stat(QFile::encodeName(mapPath()).constData(), &map), 0);
+        QCOMPARE(QList<uint>({ map.st_uid, map.st_mode & 07777 }), QList<uint>({ 0, 0644 }));
+        QVERIFY(!m_root.readFile(QStringLiteral("/run/cache-kest.map")).contains("alice-password"));
+        QVERIFY(m_server.clearRequests());
+        QCOMPARE(call("getpwuid", "10001"), QByteArray("1 @alice:10001:Alice"));
+        QCOMPARE(call("initgroups", "@alice"), QByteArray("1 27 7"));
+        QCOMPARE(serverRequests(), 0);
+        for (const QByteArray &unknown : { QByteArray("getpwnam @carol"), QByteArray("getpwuid 10099") }) {
+            const QByteArray function = unknown.split(' ').at(0), key = unknown.split(' ').at(1);
+            QVERIFY(m_server.clearRequests());
+            QCOMPARE(call(function, key), QByteArray("0"));
+            const int asked = serverRequests();
+            QVERIFY(asked > 0);
+            QCOMPARE(call(function, key), QByteArray("0"));
+            QCOMPARE(serverRequests(), asked);
+            QTest::qWait(2100);
+            QCOMPARE(call(function, key), QByteArray("0"));
+            QCOMPARE(serverRequests(), 2 * asked);
+        }
+    }
+
+    // The front service deletes a record file (and the server no longer knows the account): the map
+    // loses it well within the stated bound.
+    void removedByFrontService()
+    {
+        QCOMPARE(call("getpwnam", "@bob"), QByteArray("1 @bob:10002:Bob"));
+        QJsonObject data = DomainServerFixture::defaultData();
+        QJsonArray users = data.value(QLatin1String("users")).toArray();
+        users.removeLast();
+        data.insert(QStringLiteral("users"), users);
+        QVERIFY(m_server.setData(data));
+        QVERIFY(QFile::remove(m_root.workDir() + QStringLiteral("/10002")));
+        QElapsedTimer timer;
+        timer.start();
+        QTRY_COMPARE_WITH_TIMEOUT(call("getpwuid", "10002"), QByteArray("0"), 2000);
+        QVERIFY2(timer.elapsed() < 1000, qPrintable(QString::number(timer.elapsed())));
+        QVERIFY(m_server.setData(DomainServerFixture::defaultData()));
+    }
+
+    void enableOffWithdrawsTheMap()
+    {
+        QVERIFY(m_root.writeSettings(settings(2, false)));
+        QTRY_VERIFY_WITH_TIMEOUT(!QFileInfo::exists(mapPath()), 2000);
+        QCOMPARE(call("getpwnam", "@alice"), QByteArray("0"));
+        QVERIFY(m_root.writeSettings(settings(2)));
+        QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(mapPath()), 2000);
+        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+    }
+
+    // With cache-kest stopped the last map answers; accounts it lacks are unavailable, and a map that is
+    // not root's own, writable by others or cut short is not trusted.
+    void daemonStopped_data()
+    {
+        QTest::addColumn<QByteArray>("change"); // what is done to the map first
+        QTest::addColumn<QByteArray>("command");
+        QTest::addColumn<QByteArray>("result");
+        QTest::newRow("cached, through glibc") << QByteArray() << QByteArray("getent passwd @alice 10001")
+                                               << QByteArray("0 @alice:x:10001:10000:Alice:/home/alice:/bin/bash\n"
+                                                             "@alice:x:10001:10000:Alice:/home/alice:/bin/bash\n");
+        QTest::newRow("group, through glibc")
+            << QByteArray() << QByteArray("getent group kest") << QByteArray("0 kest:x:10000:@alice,@bob\n");
+        QTest::newRow("groups") << QByteArray() << QByteArray("initgroups @alice") << QByteArray("1");
+        QTest::newRow("not in the map") << QByteArray() << QByteArray("getpwnam @bob") << QByteArray("-1");
+        QTest::newRow("owned by another user")
+            << QByteArray("chown") << QByteArray("getpwnam @alice") << QByteArray("-1");
+        QTest::newRow("writable by group") << QByteArray("chmod") << QByteArray("getpwnam @alice") << QByteArray("-1");
+        QTest::newRow("cut short") << QByteArray("cut") << QByteArray("getpwnam @alice") << QByteArray("-1");
+    }
+
+    void daemonStopped()
+    {
+        QFETCH(QByteArray, change);
+        QFETCH(QByteArray, command);
+        static QByteArray published;
+        if (m_daemon.isRunning()) {
+            QCOMPARE(m_daemon.stop(), 0);
+            published = m_root.readFile(QStringLiteral("/run/cache-kest.map"));
+        }
+        const QByteArray path = QFile::encodeName(mapPath());
+        QVERIFY(m_root.writeFile(
+            QStringLiteral("/run/cache-kest.map"), change == "cut" ? published.left(published.size() / 2) : published));
+        QCOMPARE(chmod(path.constData(), change == "chmod" ? 0664 : 0644), 0);
+        QCOMPARE(chown(path.constData(), change == "chown" ? 65534 : 0, 0), 0);
+        QByteArray result;
+        if (!command.startsWith("getent ")) {
+            result = call(command.split(' ').at(0), command.split(' ').at(1));
+            result = result.left(result.indexOf(' ') < 0 ? result.size() : result.indexOf(' '));
+        } else {
+            const QByteArray files = QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped")));
+            QProcess process;
+            process.setProcessChannelMode(QProcess::MergedChannels);
+            process.start(QStringLiteral("bash"),
+                { QStringLiteral("-c"),
+                    QString::fromUtf8("export LD_PRELOAD=libnss_wrapper.so NSS_WRAPPER_PASSWD=" + files
+                        + "/passwd NSS_WRAPPER_GROUP=" + files + "/group NSS_WRAPPER_MODULE_SO_PATH=" + modulePath()
+                        + " NSS_WRAPPER_MODULE_FN_PREFIX=kest; " + command) });
+            const int exitCode = process.waitForFinished(30000) ? process.exitCode() : -1;
+            result = QByteArray::number(exitCode) + ' ' + process.readAll();
+        }
+        QTEST(result, "result");
+    }
+};
+
+QTEST_GUILESS_MAIN(AccountMapTest)
+#include "test_accountmap.moc"
