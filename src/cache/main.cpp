@@ -18,6 +18,7 @@
 #include <QTimer>
 
 #include <csignal>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 namespace
@@ -53,12 +54,16 @@ int runDaemon(QCoreApplication &app)
                 + QStringLiteral(", error: ") + server.errorString();
         return 1;
     }
+    // The modules find the daemon through the pid file: systemd hears of it only once both are there.
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
+    else
+        sd_notify(0, "READY=1");
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
     service->startWorker();
 
     const int result = app.exec();
+    sd_notify(0, "STOPPING=1");
     service->stopWorker();
     server.close();
     QFile::remove(KestPaths::cachePidFile());
