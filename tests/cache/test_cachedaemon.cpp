@@ -95,7 +95,8 @@ const QByteArray settings = "[main]\nenable=true\nip=127.0.0.2\nport=0\nnetwork-
 class NotifySocket
 {
 public:
-    explicit NotifySocket(const QString &path) : m_path(QFile::encodeName(path))
+    explicit NotifySocket(const QString &path)
+        : m_path(QFile::encodeName(path))
     {
         sockaddr_un address = {};
         address.sun_family = AF_UNIX;

@@ -42,8 +42,8 @@ private Q_SLOTS:
             + "[offline_login]\nenable=true\ncache_validity=1\n"));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
-        QVERIFY(m_root.writeFile(
-            QStringLiteral("/wrapped/kest"), "auth" + service + "account" + service + "password" + service + "session" + service));
+        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/kest"),
+            "auth" + service + "account" + service + "password" + service + "session" + service));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/other"), ""));
         QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
     }
