@@ -127,6 +127,7 @@ cat >"$work/bus.conf" <<CONF
   <include>$top/data/dbus/com.nimbal.kest.iam.conf</include>
 </busconfig>
 CONF
+: >"$work/bus.address" # before the wait below reads it, as for domain.out
 dbus-daemon --config-file="$work/bus.conf" --nofork --nopidfile --print-address=1 >"$work/bus.address" 2>/dev/null &
 pids+=($!)
 wait_for 5 grep -q unix: "$work/bus.address"
@@ -141,6 +142,8 @@ cat >"$work/domain.json" <<'JSON'
  "groups": [{"gid": 10000, "name": "kest", "members": ["alice"]}]}
 JSON
 start_domain_server() {
+    # Created here, so that the wait below never reads a file the server's shell has not opened yet.
+    : >"$work/domain.out"
     "$domain_server" --address 127.0.0.2 --port "$1" --cert "$work/certs/server.pem" --key "$work/certs/server.key" \
         --ca "$work/certs/ca.pem" --data "$work/domain.json" >"$work/domain.out" 2>&1 &
     domain_pid=$!

@@ -1,6 +1,6 @@
 # deps.sh - sourced by the set-up scripts: installs the Debian packages the build and tests need.
 kest_packages=(cmake ninja-build g++ make pkg-config qtbase5-dev qtbase5-dev-tools libpam0g-dev dbus-daemon libglib2.0-bin
-    openssl git dpkg-dev debhelper lintian libnss-wrapper libpam-wrapper pamtester)
+    openssl git dpkg-dev debhelper lintian libnss-wrapper libpam-wrapper pamtester libsystemd-dev systemd debootstrap)
 
 kest_ensure_packages() {
     local missing=()

@@ -25,6 +25,7 @@
 #include <QTimer>
 
 #include <csignal>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 namespace
@@ -80,8 +81,11 @@ int runDaemon(QCoreApplication &app)
                 + QStringLiteral(", error: ") + server.errorString();
         return 1;
     }
+    // The modules find the daemon through the pid file: systemd hears of it only once both are there.
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
+    else
+        sd_notify(0, "READY=1");
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
     AccountMapPublisher accountMap(service->userList());
     QObject::connect(service, &KestCacheService::accountsWritten, &accountMap, &AccountMapPublisher::publish);
@@ -89,6 +93,7 @@ int runDaemon(QCoreApplication &app)
     service->startWorker();
 
     const int result = app.exec();
+    sd_notify(0, "STOPPING=1");
     service->stopWorker();
     server.close();
     QFile::remove(KestPaths::cachePidFile());

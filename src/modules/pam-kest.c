@@ -166,11 +166,12 @@ PAM_EXTERN int pam_sm_chauthtok(pam_handle_t *pamh, int flags, int argc, const c
     const unsigned short port = kest_daemon_port();
     if (port == 0)
         return result_of(STAGE_PASSWORD, ANSWER_NO_DAEMON, user, &options);
-    if (flags & PAM_PRELIM_CHECK)
-        return PAM_SUCCESS;
     const char *old = NULL;
-    const char *password = NULL;
     int got = pam_get_authtok(pamh, PAM_OLDAUTHTOK, &old, NULL);
+    /* The old password is asked first, as pam_unix does, whatever module asks for the new one. */
+    if (flags & PAM_PRELIM_CHECK)
+        return got;
+    const char *password = NULL;
     if (got == PAM_SUCCESS)
         got = pam_get_authtok(pamh, PAM_AUTHTOK, &password, NULL);
     if (got != PAM_SUCCESS || old == NULL || password == NULL)
@@ -180,18 +181,16 @@ PAM_EXTERN int pam_sm_chauthtok(pam_handle_t *pamh, int flags, int argc, const c
 
 PAM_EXTERN int pam_sm_open_session(pam_handle_t *pamh, int flags, int argc, const char **argv)
 {
-    (void)pamh;
     (void)flags;
     (void)argc;
     (void)argv;
-    return PAM_SUCCESS;
+    return network_user(pamh) != NULL ? PAM_SUCCESS : PAM_IGNORE;
 }
 
 PAM_EXTERN int pam_sm_close_session(pam_handle_t *pamh, int flags, int argc, const char **argv)
 {
-    (void)pamh;
     (void)flags;
     (void)argc;
     (void)argv;
-    return PAM_SUCCESS;
+    return network_user(pamh) != NULL ? PAM_SUCCESS : PAM_IGNORE;
 }

@@ -11,7 +11,13 @@
 #include <QElapsedTimer>
 #include <QJsonDocument>
 #include <QTcpServer>
+#include <QTcpSocket>
 #include <QTest>
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
 namespace
 {
@@ -104,6 +110,47 @@ QByteArray settings(bool enable = true)
         + "\nip=127.0.0.2\nport=" + QByteArray::number(freePort()) + "\nnetwork-timeout=1\n";
 }
 } // namespace
+
+// systemd's end of Type=notify: a datagram socket at a path, handed over in NOTIFY_SOCKET.
+class NotifySocket
+{
+public:
+    explicit NotifySocket(const QString &path)
+        : m_path(QFile::encodeName(path))
+    {
+        sockaddr_un address = {};
+        address.sun_family = AF_UNIX;
+        if (size_t(m_path.size()) >= sizeof(address.sun_path))
+            return;
+        memcpy(address.sun_path, m_path.constData(), size_t(m_path.size()));
+        m_fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        if (m_fd >= 0 && bind(m_fd, reinterpret_cast<sockaddr *>(&address), sizeof(address)) != 0) {
+            close(m_fd);
+            m_fd = -1;
+        }
+    }
+    ~NotifySocket()
+    {
+        if (m_fd >= 0)
+            close(m_fd);
+    }
+    bool isValid() const { return m_fd >= 0; }
+    QByteArray path() const { return m_path; }
+    // The next message, or "(none)" when none comes within the time.
+    QByteArray next(int milliseconds) const
+    {
+        pollfd ready = { m_fd, POLLIN, 0 };
+        char message[512];
+        if (poll(&ready, 1, milliseconds) != 1)
+            return "(none)";
+        const ssize_t length = recv(m_fd, message, sizeof(message), 0);
+        return length < 0 ? QByteArray("(error)") : QByteArray(message, int(length));
+    }
+
+private:
+    QByteArray m_path;
+    int m_fd = -1;
+};
 
 // The real cache-kest: first its request server with the domain server out of reach, then against the test domain
 // server the way the machine's modules use it, each of those checks with a daemon and server of its own.
@@ -379,6 +426,36 @@ private Q_SLOTS:
         QVERIFY(s->daemon.start());
         QVERIFY(s->login("@alice", "alice-password").startsWith(R"({"pass":false,"locked":)"));
         QTRY_COMPARE_WITH_TIMEOUT(s->login("@alice", "alice-password"), passTrue, 8000);
+    }
+
+    // Ready means listening with the pid file written, since the modules find the port there; a daemon
+    // that cannot listen never says ready.
+    void tellsSystemdWhenReady()
+    {
+        TestRoot root;
+        NotifySocket notify(root.filePath(QStringLiteral("/run/notify")));
+        QVERIFY(notify.isValid() && root.writeSettings(settings()));
+        QProcess daemon;
+        QProcessEnvironment environment = QProcessEnvironment::systemEnvironment();
+        environment.insert(QStringLiteral("NOTIFY_SOCKET"), QString::fromLocal8Bit(notify.path()));
+        daemon.setProcessEnvironment(environment);
+        daemon.start(CacheDaemonFixture::programPath(), QStringList());
+        QVERIFY(daemon.waitForStarted());
+        QCOMPARE(notify.next(15000), QByteArray("READY=1"));
+        const QList<QByteArray> pidFile = root.readFile(QStringLiteral("/run/cache-kest.pid")).split('\n');
+        QCOMPARE(pidFile.value(0).toLongLong(), daemon.processId());
+        QTcpSocket client;
+        client.connectToHost(QStringLiteral("127.0.0.1"), pidFile.value(1).toUShort());
+        QVERIFY(client.waitForConnected(5000));
+        daemon.terminate();
+        QVERIFY(daemon.waitForFinished(10000));
+        QCOMPARE(notify.next(1000), QByteArray("STOPPING=1"));
+
+        QVERIFY(root.writeSettings("[main]\nport=" + QByteArray::number(m_daemon.port()) + '\n'));
+        daemon.start(CacheDaemonFixture::programPath(), QStringList());
+        QVERIFY(daemon.waitForFinished(10000));
+        QCOMPARE(daemon.exitCode(), 1);
+        QCOMPARE(notify.next(0), QByteArray("(none)"));
     }
 
     void cleanupTestCase()

@@ -42,8 +42,8 @@ private Q_SLOTS:
             + "[offline_login]\nenable=true\ncache_validity=1\n"));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
-        QVERIFY(m_root.writeFile(
-            QStringLiteral("/wrapped/kest"), "auth" + service + "account" + service + "password" + service));
+        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/kest"),
+            "auth" + service + "account" + service + "password" + service + "session" + service));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/other"), ""));
         QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
     }
@@ -193,6 +193,10 @@ private Q_SLOTS:
         row("local name", 0, "pamtester kest root authenticate", 1, unknown);
         row("account", 0, "pamtester kest @alice acct_mgmt", 0, "pamtester: account management done.\n");
         row("account unknown", 0, "pamtester kest @nobody acct_mgmt", 1, unknown);
+        // A module that only ignores leaves the stack without a decision, which PAM refuses.
+        row("session", 0, "pamtester kest @alice open_session close_session", 0,
+            "pamtester: successfully opened a session\npamtester: session has successfully been closed.\n");
+        row("session, local name", 0, "pamtester kest root open_session", 1, "pamtester: Permission denied\n");
         row("change, wrong old password", 0,
             "printf 'guess\\nnew-pass\\nnew-pass\\n' | pamtester kest @alice chauthtok", 1,
             change + "old password is wrong\npamtester: Authentication token manipulation error\n");

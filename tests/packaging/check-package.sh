@@ -29,13 +29,15 @@ declare -A files=(
     [kest-iam]="/etc/kest-iam.conf /lib/systemd/system/cache-kest.service /lib/systemd/system/dbus-kest.service
         /usr/bin/cache-kest /usr/sbin/dbus-kest /usr/share/dbus-1/system-services/com.nimbal.kest.iam.service
         /usr/share/dbus-1/system.d/com.nimbal.kest.iam.conf /usr/share/kest /usr/share/man/man5/kest-iam.conf.5.gz
-        /usr/share/man/man8/cache-kest.8.gz /usr/share/man/man8/dbus-kest.8.gz /var/lib/libkest-iam"
+        /usr/share/man/man8/cache-kest.8.gz /usr/share/man/man8/dbus-kest.8.gz /var/lib/libkest-iam
+        /usr/share/doc/kest-iam/README.md.gz /usr/share/doc/kest-iam/enrolment.md"
     [libkest-iam1]="/usr/lib/$ma/libkest-iam.so.1 /usr/lib/$ma/libkest-iam.so.1.0.0"
     [libkest-iam-dev]="/usr/include/kest-iam/cache-common.h /usr/include/kest-iam/common.h
         /usr/include/kest-iam/paths.h /usr/lib/$ma/libkest-iam.so /usr/lib/$ma/pkgconfig/kest-iam.pc"
     [libnss-kest]="/usr/lib/$ma/libnss_kest.so.2 /usr/lib/libnss-kest/kest-nsswitch
         /usr/share/man/man8/libnss_kest.8.gz"
-    [libpam-kest]="/usr/lib/$ma/security/pam_kest.so /usr/share/pam-configs/kest /usr/share/man/man8/pam_kest.8.gz"
+    [libpam-kest]="/usr/lib/$ma/security/pam_kest.so /usr/share/pam-configs/kest /usr/share/pam-configs/kest-password
+        /usr/share/man/man8/pam_kest.8.gz"
 )
 # Patterns, separated by ";", that must (or, after "!", must not) match a package's Depends.
 declare -A depends=(
@@ -126,6 +128,13 @@ printf '%s\n' 'passwd: files systemd # listed by hand' 'group: files' 'shadow: f
 for sample in "others others.added others" "listed listed listed.removed"; do
     check "nsswitch.conf sample ${sample%% *}: install, reinstall and remove" nss_edits $sample
 done
+
+# The install test installs these very packages: kept for it, and only when they pass.
+if [ "$failed" -eq 0 ] && [ -n "${KEST_PACKAGE_DIR:-}" ]; then
+    rm -rf "$KEST_PACKAGE_DIR"
+    mkdir -p "$KEST_PACKAGE_DIR"
+    cp "${debs[@]}" "$KEST_PACKAGE_DIR/"
+fi
 
 echo "$failed failed"
 [ "$failed" -eq 0 ]
