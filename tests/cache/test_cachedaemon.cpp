@@ -95,19 +95,21 @@ const QByteArray missingField
     = errorReply("The JSON field is missing. version, functionName and argv are required !!!");
 // Expected in place of a reply: none within 400 ms, the connection closed, or the client going away itself.
 const QByteArray noReply = "(none)", closed = "(closed)", vanish = "(vanish)";
+quint16 unusedPort()
+{
+    QTcpServer probe;
+    return probe.listen(QHostAddress(QStringLiteral("127.0.0.1"))) ? probe.serverPort() : 0;
+}
 // A port free at start: the daemon listens on it, and nothing answers there at 127.0.0.2.
 quint16 freePort()
 {
-    static quint16 port = 0;
-    QTcpServer probe;
-    if (port == 0 && probe.listen(QHostAddress(QStringLiteral("127.0.0.1"))))
-        port = probe.serverPort();
+    static const quint16 port = unusedPort();
     return port;
 }
-QByteArray settings(bool enable = true)
+QByteArray settings(bool enable = true, quint16 port = freePort())
 {
     return "[main]\nenable=" + QByteArray(enable ? "true" : "false")
-        + "\nip=127.0.0.2\nport=" + QByteArray::number(freePort()) + "\nnetwork-timeout=1\n";
+        + "\nip=127.0.0.2\nport=" + QByteArray::number(port) + "\nnetwork-timeout=1\n";
 }
 } // namespace
 
@@ -434,7 +436,7 @@ private Q_SLOTS:
     {
         TestRoot root;
         NotifySocket notify(root.filePath(QStringLiteral("/run/notify")));
-        QVERIFY(notify.isValid() && root.writeSettings(settings()));
+        QVERIFY(notify.isValid() && root.writeSettings(settings(true, unusedPort())));
         QProcess daemon;
         QProcessEnvironment environment = QProcessEnvironment::systemEnvironment();
         environment.insert(QStringLiteral("NOTIFY_SOCKET"), QString::fromLocal8Bit(notify.path()));

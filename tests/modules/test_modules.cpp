@@ -3,6 +3,7 @@
 #include "domainserverfixture.h"
 #include "loopbackpeer.h"
 #include "testroot.h"
+#include "wrappedcommand.h"
 
 #include <QJsonDocument>
 #include <QProcess>
@@ -24,7 +25,6 @@ class ModulesTest : public QObject
     CacheDaemonFixture m_daemon;
     QScopedPointer<Blackhole> m_blackhole;
 
-    static QByteArray modulePath(const char *name) { return qgetenv("KEST_TEST_BINARY_DIR") + "/src/modules/" + name; }
     // An entry point of the loaded name-service module, called the way glibc calls it.
     template<typename... Arguments> nss_status nss(const char *function, Arguments... arguments) const
     {
@@ -34,9 +34,9 @@ class ModulesTest : public QObject
 private Q_SLOTS:
     void initTestCase()
     {
-        m_nss = dlopen(modulePath("libnss_kest.so.2").constData(), RTLD_NOW | RTLD_LOCAL);
+        m_nss = dlopen(WrappedCommand::modulePath("libnss_kest.so.2").constData(), RTLD_NOW | RTLD_LOCAL);
         QVERIFY2(m_nss, dlerror());
-        const QByteArray service = " required " + modulePath("pam_kest.so") + '\n';
+        const QByteArray service = " required " + WrappedCommand::modulePath("pam_kest.so") + '\n';
         QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
         QVERIFY(m_root.writeSettings(m_server.settingsIni({ { QStringLiteral("main/enable"), true } })
             + "[offline_login]\nenable=true\ncache_validity=1\n"));
@@ -223,21 +223,7 @@ private Q_SLOTS:
         }
         if (stage == 2)
             m_daemon.stop();
-        // Under the wrappers the machine's own passwd, group and PAM files are never read. One wrapper per
-        // program: under the sanitizer's runtime the two together bind libc deeply.
-        const QByteArray preload = qgetenv("KEST_MODULE_PRELOAD"),
-                         files = QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped")));
-        const QByteArray wrapper = command.contains("pamtester") ? "libpam_wrapper.so" : "libnss_wrapper.so";
-        const QByteArray environment = "export LD_PRELOAD='" + (preload + ' ' + wrapper).trimmed()
-            + "' NSS_WRAPPER_PASSWD=" + files + "/passwd NSS_WRAPPER_GROUP=" + files
-            + "/group NSS_WRAPPER_MODULE_SO_PATH=" + modulePath("libnss_kest.so.2")
-            + " NSS_WRAPPER_MODULE_FN_PREFIX=kest NSS_WRAPPER_DISABLE_DEEPBIND=" + (preload.isEmpty() ? "" : "1")
-            + " PAM_WRAPPER=1 PAM_WRAPPER_SERVICE_DIR=" + files + "; ";
-        QProcess process;
-        process.setProcessChannelMode(QProcess::MergedChannels);
-        process.start(QStringLiteral("bash"), { QStringLiteral("-c"), QString::fromUtf8(environment + command) });
-        const int exitCode = process.waitForFinished(30000) ? process.exitCode() : -1;
-        QTEST(QByteArray::number(exitCode) + ' ' + process.readAll(), "result");
+        QTEST(WrappedCommand::run(QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped"))), command), "result");
     }
 };
 
