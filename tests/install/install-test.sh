@@ -129,7 +129,7 @@ snapshot >"$work/etc.before"
 # What the packages hold that the root does not have yet: none of it may stay after the purge.
 for deb in "$root"/tmp/debs/*.deb; do dpkg-deb -c "$deb" | awk '{ print substr($6, 2) }' | sed 's|/$||'; done \
     | while read -r path; do [ -e "$root$path" ] || [ -L "$root$path" ] || echo "$path"; done >"$work/package-paths"
-printf '%s\n' /usr/share/kest/machine.txt /run/cache-kest.pid /run/dbus-kest.pid >>"$work/package-paths"
+printf '%s\n' /usr/share/kest/machine.txt /run/cache-kest.pid /run/cache-kest.map /run/dbus-kest.pid >>"$work/package-paths"
 
 check "apt-get install ./*.deb" succeeds "" sh -c 'cd /tmp/debs && apt-get install -y -q ./*.deb'
 check "nsswitch.conf lists kest" grep -Eq '^passwd:.* kest' "$root/etc/nsswitch.conf"
