@@ -15,28 +15,11 @@ namespace
 {
 const QString kScratchSuffix = QStringLiteral(".kest-new-");
 
+// Qt keeps the owner's bits four bits higher than the group's, which it keeps as the mode does.
 mode_t modeOf(QFileDevice::Permissions permissions)
 {
-    mode_t mode = 0;
-    if (permissions & QFileDevice::ReadOwner)
-        mode |= S_IRUSR;
-    if (permissions & QFileDevice::WriteOwner)
-        mode |= S_IWUSR;
-    if (permissions & QFileDevice::ExeOwner)
-        mode |= S_IXUSR;
-    if (permissions & QFileDevice::ReadGroup)
-        mode |= S_IRGRP;
-    if (permissions & QFileDevice::WriteGroup)
-        mode |= S_IWGRP;
-    if (permissions & QFileDevice::ExeGroup)
-        mode |= S_IXGRP;
-    if (permissions & QFileDevice::ReadOther)
-        mode |= S_IROTH;
-    if (permissions & QFileDevice::WriteOther)
-        mode |= S_IWOTH;
-    if (permissions & QFileDevice::ExeOther)
-        mode |= S_IXOTH;
-    return mode;
+    const uint bits = uint(permissions);
+    return mode_t(((bits & 0x7000) >> 6) | ((bits & 0x70) >> 1) | (bits & 0x7));
 }
 
 // Only a regular file that is not a link counts: a link at the name is to be replaced.
