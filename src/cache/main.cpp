@@ -83,8 +83,10 @@ int runDaemon(QCoreApplication &app)
     if (!writePidFile(server.serverPort()))
         qWarning().noquote() << QStringLiteral("can not create pid file: ") + KestPaths::cachePidFile();
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
-    AccountMapPublisher accountMap(service->userList());
+    AccountMapPublisher accountMap(service->userList(), service->negativeAnswers());
     QObject::connect(service, &KestCacheService::accountsWritten, &accountMap, &AccountMapPublisher::publish);
+    QObject::connect(
+        service, &KestCacheService::negativeAnswersChanged, &accountMap, &AccountMapPublisher::negativeAnswersChanged);
     accountMap.publish();
     service->startWorker();
 
