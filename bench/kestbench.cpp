@@ -295,10 +295,11 @@ QList<Row> mapRows(const QString &prefix, Floor &floor, qint64 daemonPid, QStrin
                 + QStringLiteral("cache-kest CPU over 15,000 map look-ups: %1 clock ticks")
                       .arg(cpuTicksOf(daemonPid) - ticksBefore);
         byName("@nobody");
-        rows << Row { prefix + QStringLiteral("getpwnam_r, unknown name again within the negative time"),
-            measure(
-                200, [&] { byName("@nobody"); }, &floor),
-            floor.row.name };
+        // The daemon answers first and publishes the negative answer a few milliseconds later: the row
+        // measures the look-ups after that.
+        QThread::msleep(100);
+        rows << Row { prefix + QStringLiteral("getpwnam_r, unknown name again within the negative time (per 10 calls)"),
+            measure(200, tenTimes([&] { byName("@nobody"); }), &floor), floor.row.name };
     }
     dlclose(module);
     return rows;

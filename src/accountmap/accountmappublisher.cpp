@@ -157,6 +157,14 @@ void AccountMapPublisher::negativeAnswersChanged()
         m_settle.start();
 }
 
+void AccountMapPublisher::dropNegativeAnswers()
+{
+    m_negatives = nullptr;
+    if (!m_published.isEmpty())
+        rewrite(false);
+    m_expiry.stop();
+}
+
 bool AccountMapPublisher::rewrite(bool accountsChanged)
 {
     m_settle.stop();

@@ -38,6 +38,8 @@ public Q_SLOTS:
     bool publish();
     // Rewritten shortly after, with the accounts laid out again only if their files changed meanwhile.
     void negativeAnswersChanged();
+    // The daemon stops: its negative answers leave the map, which the module heeds only while it runs.
+    void dropNegativeAnswers();
 
 private:
     struct Kept {

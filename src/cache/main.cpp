@@ -91,6 +91,7 @@ int runDaemon(QCoreApplication &app)
     service->startWorker();
 
     const int result = app.exec();
+    accountMap.dropNegativeAnswers();
     service->stopWorker();
     server.close();
     QFile::remove(KestPaths::cachePidFile());

@@ -12,6 +12,7 @@
 #include <pthread.h>
 #include <pwd.h>
 #include <signal.h>
+#include <stdatomic.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -163,14 +164,24 @@ static enum kest_map_result account_of_uid(const struct kest_map_view *view, voi
     return result == KEST_MAP_FOUND ? copy_account(view, &account, query) : result;
 }
 
-/* A negative answer is the daemon's own: once it is gone, a name it lacks is "unavailable" as before. */
+/* The daemon last found running and the second it was found in (pid << 32 | second): asking the kernel
+ * costs about as much as the rest of the look-up, so it is asked once a second. */
+static _Atomic uint64_t found_running;
+
+/* A negative answer is the daemon's own: once it is gone, a name it lacks is "unavailable" as before. One
+ * that stops withdraws its negative answers from the map first; one that dies shows within a second. */
 static int daemon_runs(uint32_t pid)
 {
     if (pid == 0 || pid > INT_MAX)
         return 0;
+    const uint64_t mark = (uint64_t)pid << 32 | ((uint64_t)time(NULL) & UINT32_MAX);
+    if (atomic_load_explicit(&found_running, memory_order_relaxed) == mark)
+        return 1;
     const int saved = errno;
     const int runs = kill((pid_t)pid, 0) == 0 || errno == EPERM;
     errno = saved;
+    if (runs)
+        atomic_store_explicit(&found_running, mark, memory_order_relaxed);
     return runs;
 }
 
