@@ -23,6 +23,9 @@ const QFileDevice::Permissions mapPermissions
     = QFileDevice::ReadOwner | QFileDevice::WriteOwner | QFileDevice::ReadGroup | QFileDevice::ReadOther;
 // An ended negative answer left in the map is harmless while the clock runs on: one pass drops a batch.
 const int expirySlackMs = 1000;
+// Longer than any account name: such a name is left to the daemon, so that requests for many long names
+// cannot grow the map past what the module maps.
+const int longestPublishedName = 256;
 } // namespace
 
 AccountMapPublisher::AccountMapPublisher(const UserListManager *users, NegativeAnswers *negatives, QObject *parent)
@@ -135,10 +138,11 @@ QList<AccountMap::NegativeAnswer> AccountMapPublisher::standingNegatives()
     qint64 first = -1;
     for (const NegativeAnswers::Standing &standing : m_negatives->current()) {
         const qint64 left = standing.until.remainingTime();
-        if (left < 0)
+        const QByteArray name = standing.name.toUtf8();
+        if (left < 0 || name.size() > longestPublishedName)
             continue;
         // Whole seconds, rounded down: the map never answers "no" longer than the daemon would.
-        answers.append({ standing.name.toUtf8(), standing.uid, (now + left) / 1000 });
+        answers.append({ name, standing.uid, (now + left) / 1000 });
         first = first < 0 ? left : qMin(first, left);
     }
     if (first >= 0)
