@@ -279,18 +279,14 @@ private Q_SLOTS:
             result = call(command.split(' ').at(0), command.split(' ').at(1));
             result = result.left(result.indexOf(' ') < 0 ? result.size() : result.indexOf(' '));
         } else {
-            // The sanitizer build's runtime comes first into the uninstrumented getent.
-            const QByteArray files = QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped"))),
-                             preload = qgetenv("KEST_MODULE_PRELOAD");
+            const QByteArray files = QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped")));
             QProcess process;
             process.setProcessChannelMode(QProcess::MergedChannels);
             process.start(QStringLiteral("bash"),
                 { QStringLiteral("-c"),
-                    QString::fromUtf8("export LD_PRELOAD='" + (preload + " libnss_wrapper.so").trimmed()
-                        + "' NSS_WRAPPER_PASSWD=" + files + "/passwd NSS_WRAPPER_GROUP=" + files
-                        + "/group NSS_WRAPPER_MODULE_SO_PATH=" + modulePath()
-                        + " NSS_WRAPPER_MODULE_FN_PREFIX=kest NSS_WRAPPER_DISABLE_DEEPBIND="
-                        + (preload.isEmpty() ? "" : "1") + "; " + command) });
+                    QString::fromUtf8("export LD_PRELOAD=libnss_wrapper.so NSS_WRAPPER_PASSWD=" + files
+                        + "/passwd NSS_WRAPPER_GROUP=" + files + "/group NSS_WRAPPER_MODULE_SO_PATH=" + modulePath()
+                        + " NSS_WRAPPER_MODULE_FN_PREFIX=kest; " + command) });
             const int exitCode = process.waitForFinished(30000) ? process.exitCode() : -1;
             result = QByteArray::number(exitCode) + ' ' + process.readAll();
         }
