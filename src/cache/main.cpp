@@ -87,11 +87,11 @@ int runDaemon(QCoreApplication &app)
     QObject::connect(service, &KestCacheService::accountsWritten, &accountMap, &AccountMapPublisher::publish);
     QObject::connect(
         service, &KestCacheService::negativeAnswersChanged, &accountMap, &AccountMapPublisher::negativeAnswersChanged);
+    QObject::connect(&app, &QCoreApplication::aboutToQuit, &accountMap, &AccountMapPublisher::dropNegativeAnswers);
     accountMap.publish();
     service->startWorker();
 
     const int result = app.exec();
-    accountMap.dropNegativeAnswers();
     service->stopWorker();
     server.close();
     QFile::remove(KestPaths::cachePidFile());
