@@ -212,5 +212,50 @@ QByteArray AccountMap::toBytes() const
     appendRaw(out, ids.constData(), ids.size());
     out += strings;
     out.append(int(at) - out.size(), '\0');
+    return withNegativeAnswers(out, {}, 0);
+}
+
+QByteArray AccountMap::withNegativeAnswers(
+    const QByteArray &bytes, const QList<NegativeAnswer> &answers, quint32 daemonPid)
+{
+    kest_map_header header;
+    if (bytes.size() < int(sizeof(header)))
+        return QByteArray();
+    memcpy(&header, bytes.constData(), sizeof(header));
+    // The accounts and groups end where the strings do; whatever followed them is replaced.
+    const quint32 at = header.strings + (header.string_size + 3) / 4 * 4;
+    if (at > quint32(bytes.size()))
+        return QByteArray();
+    Block block;
+    QVector<kest_map_negative> negatives;
+    header.daemon_pid = daemonPid;
+    header.negative_count = quint32(answers.size());
+    header.negative_slots = slotsFor(answers.size());
+    Index names(int(header.negative_slots)), uids(int(header.negative_slots));
+    for (int i = 0; i < answers.size(); ++i) {
+        const NegativeAnswer &answer = answers.at(i);
+        negatives.append({ block.text(answer.name), answer.uid, 0, answer.until });
+        if (answer.name.isEmpty())
+            insert(uids, kest_map_hash_id(answer.uid), i);
+        else
+            insert(names, textHash(answer.name), i);
+    }
+    const QByteArray strings = block.strings();
+    header.negatives = at;
+    header.negative_names = header.negatives + header.negative_count * sizeof(kest_map_negative);
+    header.negative_uids = header.negative_names + header.negative_slots * 4;
+    header.negative_strings = header.negative_uids + header.negative_slots * 4;
+    header.negative_string_size = quint32(strings.size());
+    header.size = header.negative_strings + (header.negative_string_size + 3) / 4 * 4;
+
+    QByteArray out;
+    out.reserve(int(header.size));
+    appendRaw(out, &header, 1);
+    out.append(bytes.constData() + sizeof(header), int(at - sizeof(header)));
+    appendRaw(out, negatives.constData(), negatives.size());
+    appendRaw(out, names.constData(), names.size());
+    appendRaw(out, uids.constData(), uids.size());
+    out += strings;
+    out.append(int(header.size) - out.size(), '\0');
     return out;
 }

@@ -24,8 +24,20 @@ public:
     // with a decimal gid other than 0; the first line of a name or gid is the one found.
     void setGroupList(const QByteArray &text);
 
+    // A name or uid the domain server said does not exist; until: seconds since the epoch.
+    struct NegativeAnswer {
+        QByteArray name; // empty for a uid
+        quint32 uid = 0;
+        qint64 until = 0;
+    };
+
     int accountCount() const { return m_accounts.size(); }
+    // Without negative answers: those change far more often than the accounts, and are laid behind them.
     QByteArray toBytes() const;
+    // bytes (of toBytes()) with its negative answers replaced by answers, which the module heeds while the
+    // process daemonPid runs.
+    static QByteArray withNegativeAnswers(
+        const QByteArray &bytes, const QList<NegativeAnswer> &answers, quint32 daemonPid);
 
 private:
     struct Group {

@@ -21,6 +21,7 @@ ChangeWatch::ChangeWatch(QObject *parent)
     : QObject(parent)
     , m_fd(inotify_init1(IN_NONBLOCK | IN_CLOEXEC))
 {
+    m_changes.everything = true;
     if (m_fd < 0) {
         qWarning().noquote() << QStringLiteral("cannot watch for file changes: ") + qt_error_string(errno);
         return;
@@ -44,14 +45,39 @@ void ChangeWatch::watch(const QString &directory, const QString &name)
 void ChangeWatch::watchMissing()
 {
     for (Watched &watched : m_watched) {
-        if (m_fd < 0 || watched.descriptor >= 0)
+        if (watched.descriptor >= 0)
             continue;
-        watched.descriptor
-            = inotify_add_watch(m_fd, QFile::encodeName(watched.directory).constData(), watchedEvents | IN_ONLYDIR);
+        // Unwatched, nothing that happens there is told: whoever asks looks at it all.
+        m_changes.everything = true;
+        if (m_fd >= 0)
+            watched.descriptor
+                = inotify_add_watch(m_fd, QFile::encodeName(watched.directory).constData(), watchedEvents | IN_ONLYDIR);
     }
 }
 
+void ChangeWatch::poll()
+{
+    if (m_fd >= 0)
+        readQueued();
+}
+
+ChangeWatch::Changes ChangeWatch::take()
+{
+    Changes changes;
+    std::swap(changes, m_changes);
+    for (const Watched &watched : qAsConst(m_watched))
+        m_changes.everything = m_changes.everything || watched.descriptor < 0;
+    return changes;
+}
+
 void ChangeWatch::readEvents()
+{
+    if (readQueued())
+        Q_EMIT changed();
+}
+
+// True when an event concerned a watched entry.
+bool ChangeWatch::readQueued()
 {
     alignas(inotify_event) char buffer[16384];
     bool relevant = false;
@@ -60,6 +86,10 @@ void ChangeWatch::readEvents()
         for (ssize_t at = 0; at < length;) {
             const auto *event = reinterpret_cast<const inotify_event *>(buffer + at);
             at += ssize_t(sizeof(inotify_event) + event->len);
+            if (event->mask & IN_Q_OVERFLOW) {
+                m_changes.everything = true;
+                relevant = true;
+            }
             for (Watched &watched : m_watched) {
                 if (watched.descriptor != event->wd)
                     continue;
@@ -68,13 +98,14 @@ void ChangeWatch::readEvents()
                     if (event->mask & IN_MOVE_SELF)
                         inotify_rm_watch(m_fd, event->wd);
                     watched.descriptor = -1;
+                    m_changes.everything = true;
                     relevant = true;
-                } else if (watched.name.isEmpty() || (event->len > 0 && watched.name == event->name)) {
+                } else if (event->len > 0 && (watched.name.isEmpty() || watched.name == event->name)) {
+                    m_changes.paths.insert(watched.directory + QLatin1Char('/') + QFile::decodeName(event->name));
                     relevant = true;
                 }
             }
         }
     }
-    if (relevant)
-        Q_EMIT changed();
+    return relevant;
 }

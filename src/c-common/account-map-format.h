@@ -11,7 +11,7 @@
  * power-of-two number of slots, each 0 (empty) or a record number plus 1; a key's probe starts at its hash
  * and walks on one slot at a time. No password or digest is ever written here: the file is world-readable. */
 
-#define KEST_MAP_MAGIC "kestmap1"
+#define KEST_MAP_MAGIC "kestmap2"
 #define KEST_MAP_MAGIC_SIZE 8
 /* Written as a number: a map of the other byte order reads differently and is refused. */
 #define KEST_MAP_BYTE_ORDER 0x01020304u
@@ -46,6 +46,16 @@ struct kest_map_group {
     uint32_t id_count;
 };
 
+/* A name or uid the domain server said does not exist: "not found" until the second since the epoch until
+ * (exclusive), while the daemon that wrote the map still runs. An entry by name has uid 0, one by uid an
+ * empty name; its text lies in the negative string area. */
+struct kest_map_negative {
+    struct kest_map_text name;
+    uint32_t uid;
+    uint32_t reserved;
+    int64_t until;
+};
+
 struct kest_map_header {
     char magic[KEST_MAP_MAGIC_SIZE];
     uint32_t byte_order;
@@ -55,6 +65,10 @@ struct kest_map_header {
     uint32_t group_count, group_slots, groups, group_names, group_gids;
     uint32_t id_count, ids;
     uint32_t string_size, strings;
+    /* Last in the file, so that new negative answers replace this part alone. */
+    uint32_t daemon_pid;
+    uint32_t negative_count, negative_slots, negatives, negative_names, negative_uids;
+    uint32_t negative_string_size, negative_strings;
 };
 
 /* FNV-1a: the same on both sides, cheap for short names. */

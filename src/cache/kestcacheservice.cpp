@@ -253,8 +253,10 @@ QString KestCacheService::queryAccountName(QString name)
         return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByName(name);
-    if (saysUnknown(reply))
+    if (saysUnknown(reply)) {
         m_unknown.remember(name);
+        Q_EMIT negativeAnswersChanged();
+    }
     return answerLookup(reply, m_users->hasUserName(name),
         QStringLiteral("offline cache doesnot persist account name: ") + name,
         QStringLiteral("web server doesnot have account name: ") + name);
@@ -268,8 +270,10 @@ QString KestCacheService::queryUid(uint uid)
         return passReply(false);
     beginCall();
     const QString reply = m_http->queryUserByUid(uid);
-    if (saysUnknown(reply))
+    if (saysUnknown(reply)) {
         m_unknown.remember(uid);
+        Q_EMIT negativeAnswersChanged();
+    }
     const QString id = QString::number(uid);
     return answerLookup(reply, m_users->hasUid(uid), QStringLiteral("offline cache doesnot persist account id: ") + id,
         QStringLiteral("web server doesnot have account uid: ") + id);
@@ -300,7 +304,8 @@ QString KestCacheService::authenticatePassword(QString username, QString passwor
             "password should not be x because linux use it to express encrypted password meaning.");
         return passReply(false);
     }
-    m_unknown.forget(username);
+    if (m_unknown.forget(username))
+        Q_EMIT negativeAnswersChanged();
     const uint uid = m_users->uidOfName(username);
     if (const qint64 until = m_throttle->lockedUntil(uid))
         return lockedReply(until);

@@ -33,6 +33,7 @@ public:
     QString changePassword(const QString &userName, const QString &newPassword, const QString &oldPassword);
 
     UserListManager *userList() const;
+    NegativeAnswers *negativeAnswers() { return &m_unknown; }
     LoginThrottle *loginThrottle() const;
 
     // The update worker runs only while the daemon listens, and is stopped before anything it uses
@@ -57,6 +58,8 @@ Q_SIGNALS:
     void updateCache();
     // A cache record or the group list was written: the account map is to show it before the reply goes.
     void accountsWritten();
+    // An answer "no such account" began or ended other than by a written account.
+    void negativeAnswersChanged();
 
 public Q_SLOTS:
     QString queryAccountName(QString name);

@@ -87,8 +87,11 @@ int runDaemon(QCoreApplication &app)
     else
         sd_notify(0, "READY=1");
     qInfo().noquote() << QStringLiteral("cache service started on port ") + QString::number(server.serverPort());
-    AccountMapPublisher accountMap(service->userList());
+    AccountMapPublisher accountMap(service->userList(), service->negativeAnswers());
     QObject::connect(service, &KestCacheService::accountsWritten, &accountMap, &AccountMapPublisher::publish);
+    QObject::connect(
+        service, &KestCacheService::negativeAnswersChanged, &accountMap, &AccountMapPublisher::negativeAnswersChanged);
+    QObject::connect(&app, &QCoreApplication::aboutToQuit, &accountMap, &AccountMapPublisher::dropNegativeAnswers);
     accountMap.publish();
     service->startWorker();
 

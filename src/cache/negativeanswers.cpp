@@ -75,8 +75,31 @@ void NegativeAnswers::remember(uint uid)
         rememberIn(m_uids, uid, until);
 }
 
-void NegativeAnswers::forget(const QString &name, uint uid)
+bool NegativeAnswers::forget(const QString &name, uint uid)
 {
-    m_names.remove(name);
-    m_uids.remove(uid);
+    const bool named = m_names.remove(name) > 0;
+    return m_uids.remove(uid) > 0 || named;
+}
+
+QList<NegativeAnswers::Standing> NegativeAnswers::current()
+{
+    settingsChanged();
+    QList<Standing> answers;
+    for (auto name = m_names.begin(); name != m_names.end();) {
+        if (name->hasExpired()) {
+            name = m_names.erase(name);
+            continue;
+        }
+        answers.append({ name.key(), 0, *name });
+        ++name;
+    }
+    for (auto uid = m_uids.begin(); uid != m_uids.end();) {
+        if (uid->hasExpired()) {
+            uid = m_uids.erase(uid);
+            continue;
+        }
+        answers.append({ QString(), uid.key(), *uid });
+        ++uid;
+    }
+    return answers;
 }

@@ -44,15 +44,25 @@ int kest_map_view_init(struct kest_map_view *view, const void *data, size_t size
         && inside(view, h->member_names, h->member_slots * word)
         && inside(view, h->groups, (uint64_t)h->group_count * sizeof(struct kest_map_group))
         && inside(view, h->group_names, h->group_slots * word) && inside(view, h->group_gids, h->group_slots * word)
-        && inside(view, h->ids, h->id_count * word) && h->strings <= size && h->string_size <= size - h->strings;
+        && inside(view, h->ids, h->id_count * word) && h->strings <= size && h->string_size <= size - h->strings
+        && is_power_of_two(h->negative_slots)
+        && inside(view, h->negatives, (uint64_t)h->negative_count * sizeof(struct kest_map_negative))
+        && inside(view, h->negative_names, h->negative_slots * word)
+        && inside(view, h->negative_uids, h->negative_slots * word) && h->negative_strings <= size
+        && h->negative_string_size <= size - h->negative_strings;
+}
+
+static const char *text_in(
+    const struct kest_map_view *view, uint32_t area, uint32_t area_size, struct kest_map_text text)
+{
+    if (text.offset > area_size || text.length > area_size - text.offset)
+        return NULL;
+    return (const char *)view->base + area + text.offset;
 }
 
 const char *kest_map_text(const struct kest_map_view *view, struct kest_map_text text)
 {
-    const struct kest_map_header *h = &view->header;
-    if (text.offset > h->string_size || text.length > h->string_size - text.offset)
-        return NULL;
-    return (const char *)view->base + h->strings + text.offset;
+    return text_in(view, view->header.strings, view->header.string_size, text);
 }
 
 int kest_map_id(const struct kest_map_view *view, uint32_t first, uint32_t i, uint32_t *out)
@@ -117,6 +127,21 @@ static int group_has_gid(const struct kest_map_view *view, const void *record, c
     return ((const struct kest_map_group *)record)->gid == *(const uint32_t *)key;
 }
 
+static int negative_has_name(const struct kest_map_view *view, const void *record, const void *key)
+{
+    const struct kest_map_text name = ((const struct kest_map_negative *)record)->name;
+    const char *bytes = text_in(view, view->header.negative_strings, view->header.negative_string_size, name);
+    size_t length = strlen(key);
+    return bytes != NULL && name.length == length && memcmp(bytes, key, length) == 0;
+}
+
+static int negative_has_uid(const struct kest_map_view *view, const void *record, const void *key)
+{
+    (void)view;
+    const struct kest_map_negative *negative = record;
+    return negative->name.length == 0 && negative->uid == *(const uint32_t *)key;
+}
+
 static struct map_index account_index(const struct kest_map_view *view, uint32_t offset)
 {
     const struct kest_map_header *h = &view->header;
@@ -129,6 +154,14 @@ static struct map_index group_index(const struct kest_map_view *view, uint32_t o
 {
     const struct kest_map_header *h = &view->header;
     struct map_index index = { h->group_slots, offset, h->group_count, h->groups, sizeof(struct kest_map_group) };
+    return index;
+}
+
+static struct map_index negative_index(const struct kest_map_view *view, uint32_t offset)
+{
+    const struct kest_map_header *h = &view->header;
+    struct map_index index
+        = { h->negative_slots, offset, h->negative_count, h->negatives, sizeof(struct kest_map_negative) };
     return index;
 }
 
@@ -179,4 +212,24 @@ enum kest_map_result kest_map_member_at(const struct kest_map_view *view, uint32
         return KEST_MAP_BROKEN;
     memcpy(out, view->base + view->header.members + (size_t)index * sizeof(*out), sizeof(*out));
     return KEST_MAP_FOUND;
+}
+
+/* An entry found is one that stands only before its end. */
+static enum kest_map_result standing(enum kest_map_result found, const struct kest_map_negative *negative, int64_t now)
+{
+    return found == KEST_MAP_FOUND && now >= negative->until ? KEST_MAP_MISSING : found;
+}
+
+enum kest_map_result kest_map_negative_name(const struct kest_map_view *view, const char *name, int64_t now)
+{
+    const struct map_index index = negative_index(view, view->header.negative_names);
+    struct kest_map_negative negative;
+    return standing(probe(view, &index, name_hash(name), negative_has_name, name, &negative), &negative, now);
+}
+
+enum kest_map_result kest_map_negative_uid(const struct kest_map_view *view, uint32_t uid, int64_t now)
+{
+    const struct map_index index = negative_index(view, view->header.negative_uids);
+    struct kest_map_negative negative;
+    return standing(probe(view, &index, kest_map_hash_id(uid), negative_has_uid, &uid, &negative), &negative, now);
 }

@@ -32,6 +32,11 @@ enum kest_map_result kest_map_group_by_gid(const struct kest_map_view *view, uin
 /* A member record by number, for a group's member list. */
 enum kest_map_result kest_map_member_at(const struct kest_map_view *view, uint32_t index, struct kest_map_member *out);
 
+/* KEST_MAP_FOUND when the map says, at now (seconds since the epoch), that the domain server has no such
+ * account; the caller still checks that the daemon that said so runs (header.daemon_pid). */
+enum kest_map_result kest_map_negative_name(const struct kest_map_view *view, const char *name, int64_t now);
+enum kest_map_result kest_map_negative_uid(const struct kest_map_view *view, uint32_t uid, int64_t now);
+
 /* The text's bytes (not NUL-terminated), or NULL when it lies outside the string area. */
 const char *kest_map_text(const struct kest_map_view *view, struct kest_map_text text);
 /* The id at first + i of the id area; 0 when outside it. */

@@ -7,12 +7,16 @@
 #include "nss-listing.h"
 
 #include <errno.h>
+#include <limits.h>
 #include <nss.h>
 #include <pthread.h>
 #include <pwd.h>
+#include <signal.h>
+#include <stdatomic.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <time.h>
 
 #define SOURCE_PATH "src/modules/nss-passwd"
 #define FIRST_DOMAIN_UID 10000
@@ -80,6 +84,7 @@ struct passwd_query {
     size_t buflen;
     int *errnop;
     enum nss_status status;
+    uint32_t denied_by; /* the daemon whose negative answer the map holds for key, or 0 */
 };
 
 /* Lets the daemon ask the domain server; 1 when the account exists. */
@@ -130,11 +135,22 @@ static enum kest_map_result copy_account(
     return KEST_MAP_FOUND;
 }
 
+/* An account the map lacks may be one the daemon already knows the domain server does not have. */
+static enum kest_map_result note_negative(
+    const struct kest_map_view *view, enum kest_map_result negative, struct passwd_query *query)
+{
+    if (negative == KEST_MAP_FOUND)
+        query->denied_by = view->header.daemon_pid;
+    return negative == KEST_MAP_BROKEN ? KEST_MAP_BROKEN : KEST_MAP_MISSING;
+}
+
 static enum kest_map_result account_of_name(const struct kest_map_view *view, void *context)
 {
     struct passwd_query *query = context;
     struct kest_map_account account;
     enum kest_map_result result = kest_map_account_by_name(view, query->name, &account);
+    if (result == KEST_MAP_MISSING)
+        return note_negative(view, kest_map_negative_name(view, query->name, (int64_t)time(NULL)), query);
     return result == KEST_MAP_FOUND ? copy_account(view, &account, query) : result;
 }
 
@@ -143,7 +159,30 @@ static enum kest_map_result account_of_uid(const struct kest_map_view *view, voi
     struct passwd_query *query = context;
     struct kest_map_account account;
     enum kest_map_result result = kest_map_account_by_uid(view, (uint32_t)query->uid, &account);
+    if (result == KEST_MAP_MISSING)
+        return note_negative(view, kest_map_negative_uid(view, (uint32_t)query->uid, (int64_t)time(NULL)), query);
     return result == KEST_MAP_FOUND ? copy_account(view, &account, query) : result;
+}
+
+/* The daemon last found running and the second it was found in (pid << 32 | second): asking the kernel
+ * costs about as much as the rest of the look-up, so it is asked once a second. */
+static _Atomic uint64_t found_running;
+
+/* A negative answer is the daemon's own: once it is gone, a name it lacks is "unavailable" as before. One
+ * that stops withdraws its negative answers from the map first; one that dies shows within a second. */
+static int daemon_runs(uint32_t pid)
+{
+    if (pid == 0 || pid > INT_MAX)
+        return 0;
+    const uint64_t mark = (uint64_t)pid << 32 | ((uint64_t)time(NULL) & UINT32_MAX);
+    if (atomic_load_explicit(&found_running, memory_order_relaxed) == mark)
+        return 1;
+    const int saved = errno;
+    const int runs = kill((pid_t)pid, 0) == 0 || errno == EPERM;
+    errno = saved;
+    if (runs)
+        atomic_store_explicit(&found_running, mark, memory_order_relaxed);
+    return runs;
 }
 
 /* From the daemon's map when it holds the account. One it lacks is one the daemon has not cached: the
@@ -155,6 +194,8 @@ static enum nss_status look_up(kest_map_use from_map, struct passwd_query *query
         return query->status;
     if (mapped == KEST_MAP_BROKEN)
         return ask_daemon(query);
+    if (daemon_runs(query->denied_by))
+        return nss_not_found(query->errnop);
     const unsigned short port = kest_daemon_port();
     if (port == 0)
         return nss_unavailable(query->errnop);
@@ -170,8 +211,8 @@ enum nss_status _nss_kest_getpwnam_r(const char *name, struct passwd *pwd, char 
     /* Local accounts never pay for this module: no network name, no work at all. */
     if (name == NULL || name[0] != '@' || name[1] == '\0')
         return nss_not_found(errnop);
-    struct passwd_query query
-        = { "getAccountByName", "queryAccountName", name, name, 0, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+    struct passwd_query query = { "getAccountByName", "queryAccountName", name, name, 0, pwd, buffer, buflen, errnop,
+        NSS_STATUS_NOTFOUND, 0 };
     return look_up(account_of_name, &query);
 }
 
@@ -182,7 +223,7 @@ enum nss_status _nss_kest_getpwuid_r(uid_t uid, struct passwd *pwd, char *buffer
     char text[UID_TEXT_SIZE];
     snprintf(text, sizeof(text), "%u", (unsigned int)uid);
     struct passwd_query query
-        = { "getAccountByUid", "queryUid", text, NULL, uid, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND };
+        = { "getAccountByUid", "queryUid", text, NULL, uid, pwd, buffer, buflen, errnop, NSS_STATUS_NOTFOUND, 0 };
     return look_up(account_of_uid, &query);
 }
 

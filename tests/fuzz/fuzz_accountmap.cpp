@@ -24,6 +24,10 @@ void lookUp(const kest_map_view &view)
         readAll(view, account);
     if (kest_map_account_by_uid(&view, 10002, &account) == KEST_MAP_FOUND)
         readAll(view, account);
+    // At a fixed instant, so that a finding replays the same way.
+    const int64_t now = 1500000000;
+    kest_map_negative_name(&view, "@carol", now);
+    kest_map_negative_uid(&view, 10099, now);
     kest_map_member member;
     uint32_t id;
     if (kest_map_member_by_name(&view, "@alice", &member) == KEST_MAP_FOUND) {

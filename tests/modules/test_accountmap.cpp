@@ -8,6 +8,7 @@ extern "C" {
 #include "account-map.h"
 }
 
+#include <QDateTime>
 #include <QElapsedTimer>
 #include <QFileInfo>
 #include <QJsonArray>
@@ -17,6 +18,7 @@ extern "C" {
 #include <grp.h>
 #include <nss.h>
 #include <pwd.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -67,6 +69,17 @@ class AccountMapTest : public QObject
         }
         return (QByteArray::number(status) + ' ' + entry).trimmed();
     }
+    // Whether the published map answers key (a name or a uid) "no such account" now.
+    bool mapSaysNo(const QByteArray &key) const
+    {
+        const QByteArray bytes = m_root.readFile(QStringLiteral("/run/cache-kest.map"));
+        const qint64 now = QDateTime::currentSecsSinceEpoch();
+        kest_map_view view;
+        return kest_map_view_init(&view, bytes.constData(), size_t(bytes.size()))
+            && (key.startsWith('@') ? kest_map_negative_name(&view, key.constData(), now)
+                                    : kest_map_negative_uid(&view, key.toUInt(), now))
+            == KEST_MAP_FOUND;
+    }
     int serverRequests() const { return m_server.requests().size(); }
 
 private Q_SLOTS:
@@ -79,6 +92,8 @@ private Q_SLOTS:
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
         QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+        // The start-up refresh asks the server for every known account: done before any is counted.
+        QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(m_root.workDir() + QStringLiteral("/groups.txt")), 5000);
     }
 
     void layout_data()
@@ -96,6 +111,10 @@ private Q_SLOTS:
         QTest::newRow("group by name") << QByteArray("group kest") << QByteArray("10000 x @alice,@bob");
         QTest::newRow("group by gid") << QByteArray("gid 27") << QByteArray("27 x admin,@alice,@alice");
         QTest::newRow("line without a valid gid") << QByteArray("group broken") << QByteArray("missing");
+        QTest::newRow("negative name") << QByteArray("no @carol") << QByteArray("standing");
+        QTest::newRow("negative uid") << QByteArray("no 10009") << QByteArray("standing");
+        QTest::newRow("negative answer ended") << QByteArray("no @dave") << QByteArray("missing");
+        QTest::newRow("replaced answer") << QByteArray("no @frank") << QByteArray("missing");
     }
 
     void layout()
@@ -108,7 +127,10 @@ private Q_SLOTS:
         map.addAccount({ 10003, 10000, "@bob", "Bob", "/b", "/bin/sh" }, false);
         map.setGroupList("sudo:x:27:admin,@alice,@alice\nkest:x:10000:@alice,@bob\nbroken:x:0:@alice\n"
                          "lpadmin:x:5001:@alice,\nsudo:x:28:@bob");
-        const QByteArray bytes = map.toBytes();
+        const qint64 now = QDateTime::currentSecsSinceEpoch();
+        const QByteArray replaced = AccountMap::withNegativeAnswers(map.toBytes(), { { "@frank", 0, now + 60 } }, 1);
+        const QByteArray bytes = AccountMap::withNegativeAnswers(replaced,
+            { { "@carol", 0, now + 60 }, { "", 10009, now + 60 }, { "@dave", 0, now }, { "", 10010, now + 60 } }, 1);
         kest_map_view view;
         QVERIFY(kest_map_view_init(&view, bytes.constData(), size_t(bytes.size())));
         // Cut anywhere, the header no longer matches the size.
@@ -121,7 +143,11 @@ private Q_SLOTS:
         const QByteArray kind = lookUp.split(' ').at(0), key = lookUp.split(' ').at(1);
         QByteArrayList found;
         kest_map_result result;
-        if (kind == "name" || kind == "uid") {
+        if (kind == "no") {
+            result = key.startsWith('@') ? kest_map_negative_name(&view, key.constData(), now)
+                                         : kest_map_negative_uid(&view, key.toUInt(), now);
+            found = { "standing" };
+        } else if (kind == "name" || kind == "uid") {
             kest_map_account account {};
             result = kind == "name" ? kest_map_account_by_name(&view, key.constData(), &account)
                                     : kest_map_account_by_uid(&view, key.toUInt(), &account);
@@ -148,7 +174,7 @@ private Q_SLOTS:
     }
 
     // A cached account is answered from the map, its groups too; an unknown one is asked for once in the
-    // negative time, and again after it.
+    // negative time, and again after it. Within it the map answers, even while the daemon is frozen.
     void daemonRunning()
     {
         QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
@@ -167,7 +193,11 @@ private Q_SLOTS:
             QCOMPARE(call(function, key), QByteArray("0"));
             const int asked = serverRequests();
             QVERIFY(asked > 0);
-            QCOMPARE(call(function, key), QByteArray("0"));
+            QTRY_VERIFY(mapSaysNo(key));
+            QCOMPARE(kill(pid_t(m_daemon.processId()), SIGSTOP), 0);
+            const QByteArray frozen = call(function, key);
+            QCOMPARE(kill(pid_t(m_daemon.processId()), SIGCONT), 0);
+            QCOMPARE(frozen, QByteArray("0"));
             QCOMPARE(serverRequests(), asked);
             QTest::qWait(2100);
             QCOMPARE(call(function, key), QByteArray("0"));
@@ -203,13 +233,15 @@ private Q_SLOTS:
         QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
     }
 
-    // With cache-kest stopped the last map answers; accounts it lacks are unavailable, and a map that is
-    // not root's own, writable by others or cut short is not trusted.
+    // With cache-kest stopped the last map answers; accounts it lacks are unavailable, its negative answers
+    // too, and a map that is not root's own, writable by others or cut short is not trusted.
     void daemonStopped_data()
     {
         QTest::addColumn<QByteArray>("change"); // what is done to the map first
         QTest::addColumn<QByteArray>("command");
         QTest::addColumn<QByteArray>("result");
+        QTest::newRow("answered no before the stop")
+            << QByteArray() << QByteArray("getpwnam @nobody") << QByteArray("-1");
         QTest::newRow("cached, through glibc") << QByteArray() << QByteArray("getent passwd @alice 10001")
                                                << QByteArray("0 @alice:x:10001:10000:Alice:/home/alice:/bin/bash\n"
                                                              "@alice:x:10001:10000:Alice:/home/alice:/bin/bash\n");
@@ -229,6 +261,10 @@ private Q_SLOTS:
         QFETCH(QByteArray, command);
         static QByteArray published;
         if (m_daemon.isRunning()) {
+            QCOMPARE(call("getpwnam", "@nobody"), QByteArray("0"));
+            QTRY_VERIFY(mapSaysNo("@nobody"));
+            // Found running by the module just before it stops.
+            QCOMPARE(call("getpwnam", "@nobody"), QByteArray("0"));
             QCOMPARE(m_daemon.stop(), 0);
             published = m_root.readFile(QStringLiteral("/run/cache-kest.map"));
         }
