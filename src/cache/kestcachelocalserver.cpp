@@ -272,31 +272,32 @@ void KestCacheLocalServer::handleServerCommand(LocalConnection *socket, const QJ
     }
 }
 
-// Deleting caches and rewriting the policy are root's alone; whoever cannot be identified is refused.
-bool KestCacheLocalServer::isRootPeer(LocalConnection *socket, int command)
+// The uid owning the client's end of the connection, or -1 when the kernel does not tell.
+qint64 KestCacheLocalServer::peerUid(LocalConnection *socket)
 {
     uid_t uid = 0;
     quint16 peerPort = 0, localPort = 0;
     const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
-    const bool known = PeerUid::lookup(peer, peerPort, local, localPort, uid);
-    if (known && uid == 0)
+    return PeerUid::lookup(peer, peerPort, local, localPort, uid) ? qint64(uid) : -1;
+}
+
+// Deleting caches and rewriting the policy are root's alone; whoever cannot be identified is refused.
+bool KestCacheLocalServer::isRootPeer(LocalConnection *socket, int command)
+{
+    const qint64 uid = peerUid(socket);
+    if (uid == 0)
         return true;
-    const qint64 shown = known ? qint64(uid) : -1;
-    qWarning().noquote() << QStringLiteral("refused server command %1 from uid %2.").arg(command).arg(shown);
+    qWarning().noquote() << QStringLiteral("refused server command %1 from uid %2.").arg(command).arg(uid);
     sendResultReply(socket, 1, QStringLiteral("permission denied !!!"));
     return false;
 }
 
 bool KestCacheLocalServer::isPasswordPeer(LocalConnection *socket, const QString &account)
 {
-    uid_t uid = 0;
-    quint16 peerPort = 0, localPort = 0;
-    const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
-    const bool known = PeerUid::lookup(peer, peerPort, local, localPort, uid);
-    if (known && (uid == 0 || uid == m_service->userList()->uidOfName(account)))
+    const qint64 uid = peerUid(socket);
+    if (uid == 0 || (uid > 0 && uid == qint64(m_service->userList()->uidOfName(account))))
         return true;
-    const qint64 shown = known ? qint64(uid) : -1;
-    qWarning().noquote() << QStringLiteral("refused password check of %1 from uid %2.").arg(account).arg(shown);
+    qWarning().noquote() << QStringLiteral("refused password check of %1 from uid %2.").arg(account).arg(uid);
     return false;
 }
 
@@ -382,10 +383,6 @@ QString KestCacheLocalServer::modifyUserPassword(LocalConnection *socket, const 
 // Open to every local user: the general state for anyone, an account's part for root and the account itself.
 void KestCacheLocalServer::sendStatus(LocalConnection *socket, const QJsonValue &data)
 {
-    uid_t uid = 0;
-    quint16 peerPort = 0, localPort = 0;
-    const QHostAddress peer = socket->peerAddress(peerPort), local = socket->localAddress(localPort);
-    const qint64 peerUid = PeerUid::lookup(peer, peerPort, local, localPort, uid) ? qint64(uid) : -1;
-    const QJsonObject status = StatusReport::build(*m_service, peerUid, data.toString().trimmed());
+    const QJsonObject status = StatusReport::build(*m_service, peerUid(socket), data.toString().trimmed());
     socket->write(frame(QJsonDocument(status).toJson(QJsonDocument::Compact)));
 }

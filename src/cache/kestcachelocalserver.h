@@ -43,6 +43,7 @@ private:
     QString dispatchFunctionCall(LocalConnection *socket, const QJsonObject &request);
     QString callService(const QString &name, const QStringList &arguments);
     void handleServerCommand(LocalConnection *socket, const QJsonObject &request);
+    static qint64 peerUid(LocalConnection *socket);
     bool isRootPeer(LocalConnection *socket, int command);
     // Password checks and changes are answered for root and for the account itself only.
     bool isPasswordPeer(LocalConnection *socket, const QString &account);
