@@ -1,5 +1,6 @@
 #pragma once
 
+#include <QList>
 #include <QString>
 #include <QVariant>
 
@@ -23,9 +24,12 @@ public:
         Type type;
         int minimum;
         int maximum;
+        // Part of the password policy that the domain server sends and the desktop reads.
+        bool policy = false;
     };
 
     static const Key *find(const QString &group, const QString &name);
+    static QList<const Key *> policyKeys();
     static bool isKnownGroup(const QString &group);
     // The known key closest in spelling, as "[group] key"; keys of the given group win a tie.
     static QString nearestKey(const QString &group, const QString &name);

@@ -40,28 +40,29 @@ const SettingsSchema::Key keys[] = {
     { "group", "length-limit", Type::Int, 1, noLimit },
     { "group", "member-count-limit", Type::Int, 0, noLimit },
     { "group", "buffer-limit", Type::Int, 1, noLimit },
-    { "offline_login", "enable", Type::Bool, 0, 0 },
+    { "offline_login", "enable", Type::Bool, 0, 0, true },
     // Days; a negative number reads as 0, which lets no account log in offline at all.
-    { "offline_login", "cache_validity", Type::Int, 0, 49710 },
-    { "pw_strength", "character_enable", Type::Bool, 0, 0 },
-    { "pw_strength", "characters", Type::Text, 0, 0 },
-    { "pw_strength", "contains_user", Type::Bool, 0, 0 },
-    { "pw_strength", "lower", Type::Bool, 0, 0 },
-    { "pw_strength", "max_length", Type::Int, 0, noLimit },
-    { "pw_strength", "min_length", Type::Int, 0, noLimit },
-    { "pw_strength", "number", Type::Bool, 0, 0 },
-    { "pw_strength", "required", Type::Int, 0, noLimit },
-    { "pw_strength", "special_enable", Type::Bool, 0, 0 },
-    { "pw_strength", "special_string", Type::Text, 0, 0 },
-    { "pw_strength", "strength", Type::Bool, 0, 0 },
-    { "pw_strength", "upper", Type::Bool, 0, 0 },
-    { "pw_validity", "enable", Type::Bool, 0, 0 },
-    { "pw_validity", "effective_time", Type::Int, 0, noLimit },
-    { "pw_validity", "tip_time", Type::Int, 0, noLimit },
-    { "pw_history_check", "enable", Type::Bool, 0, 0 },
-    { "pw_history_check", "history_num", Type::Int, 0, noLimit },
-    { "first_login", "enable", Type::Bool, 0, 0 },
-    { "first_login", "update_password", Type::Bool, 0, 0 },
+    { "offline_login", "cache_validity", Type::Int, 0, 49710, true },
+    { "pw_strength", "character_enable", Type::Bool, 0, 0, true },
+    { "pw_strength", "characters", Type::Text, 0, 0, true },
+    { "pw_strength", "contains_user", Type::Bool, 0, 0, true },
+    { "pw_strength", "lower", Type::Bool, 0, 0, true },
+    { "pw_strength", "max_length", Type::Int, 0, noLimit, true },
+    { "pw_strength", "min_length", Type::Int, 0, noLimit, true },
+    { "pw_strength", "number", Type::Bool, 0, 0, true },
+    { "pw_strength", "required", Type::Int, 0, noLimit, true },
+    { "pw_strength", "special_enable", Type::Bool, 0, 0, true },
+    { "pw_strength", "special_string", Type::Text, 0, 0, true },
+    // Deliberately a boolean, unlike the numeric "required" beside it.
+    { "pw_strength", "strength", Type::Bool, 0, 0, true },
+    { "pw_strength", "upper", Type::Bool, 0, 0, true },
+    { "pw_validity", "enable", Type::Bool, 0, 0, true },
+    { "pw_validity", "effective_time", Type::Int, 0, noLimit, true },
+    { "pw_validity", "tip_time", Type::Int, 0, noLimit, true },
+    { "pw_history_check", "enable", Type::Bool, 0, 0, true },
+    { "pw_history_check", "history_num", Type::Int, 0, noLimit, true },
+    { "first_login", "enable", Type::Bool, 0, 0, true },
+    { "first_login", "update_password", Type::Bool, 0, 0, true },
 };
 
 int editDistance(const QString &a, const QString &b)
@@ -93,6 +94,16 @@ const SettingsSchema::Key *SettingsSchema::find(const QString &group, const QStr
     const auto found = std::find_if(std::begin(keys), std::end(keys),
         [&](const Key &key) { return group == QLatin1String(key.group) && name == QLatin1String(key.name); });
     return found == std::end(keys) ? nullptr : found;
+}
+
+QList<const SettingsSchema::Key *> SettingsSchema::policyKeys()
+{
+    QList<const Key *> found;
+    for (const Key &key : keys) {
+        if (key.policy)
+            found.append(&key);
+    }
+    return found;
 }
 
 bool SettingsSchema::isKnownGroup(const QString &group)
