@@ -1,6 +1,7 @@
 #include "accountmap.h"
 #include "cachedaemonfixture.h"
 #include "domainserverfixture.h"
+#include "nssmodule.h"
 #include "testroot.h"
 #include "wrappedcommand.h"
 
@@ -14,10 +15,6 @@ extern "C" {
 #include <QJsonArray>
 #include <QTest>
 
-#include <dlfcn.h>
-#include <grp.h>
-#include <nss.h>
-#include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -27,7 +24,7 @@ extern "C" {
 class AccountMapTest : public QObject
 {
     Q_OBJECT
-    void *m_nss = nullptr;
+    NssModule m_nss;
     TestRoot m_root;
     DomainServerFixture m_server;
     CacheDaemonFixture m_daemon;
@@ -39,35 +36,12 @@ class AccountMapTest : public QObject
             { QStringLiteral("main/negative-cache-timeout"), negativeSeconds } });
     }
 
-    template<typename... Arguments> nss_status (*entry_point(const char *name) const)(Arguments...)
-    {
-        return reinterpret_cast<nss_status (*)(Arguments...)>(dlsym(m_nss, name));
-    }
-    // "status entry" of one call of the loaded module: the entry as a passwd line or a gid list.
+    // "status entry" of one call of the loaded module (see NssModule::call).
     QByteArray call(const QByteArray &function, const QByteArray &key) const
     {
-        char buffer[1024];
-        int error = 0, status;
-        passwd pwd {};
-        QByteArray entry;
-        if (function == "getpwnam" || function == "getpwuid") {
-            const bool byName = function == "getpwnam";
-            status = byName ? entry_point<const char *, passwd *, char *, size_t, int *>("_nss_kest_getpwnam_r")(
-                         key.constData(), &pwd, buffer, sizeof(buffer), &error)
-                            : entry_point<uid_t, passwd *, char *, size_t, int *>("_nss_kest_getpwuid_r")(
-                                uid_t(key.toUInt()), &pwd, buffer, sizeof(buffer), &error);
-            if (status == NSS_STATUS_SUCCESS)
-                entry = QByteArrayList({ pwd.pw_name, QByteArray::number(pwd.pw_uid), pwd.pw_gecos }).join(':');
-        } else {
-            long start = 0, size = 0;
-            gid_t *groups = nullptr;
-            status = entry_point<const char *, gid_t, long *, long *, gid_t **, long, int *>(
-                "_nss_kest_initgroups_dyn")(key.constData(), gid_t(10000), &start, &size, &groups, 0L, &error);
-            for (long i = 0; i < start; ++i)
-                entry += QByteArray::number(groups[i]) + ' ';
-            free(groups);
-        }
-        return (QByteArray::number(status) + ' ' + entry).trimmed();
+        QByteArrayList parts = m_nss.call(function, key).split(' ');
+        parts.removeAt(1);
+        return parts.join(' ');
     }
     // Whether the published map answers key (a name or a uid) "no such account" now.
     bool mapSaysNo(const QByteArray &key) const
@@ -81,12 +55,12 @@ class AccountMapTest : public QObject
             == KEST_MAP_FOUND;
     }
     int serverRequests() const { return m_server.requests().size(); }
+    const QByteArray alice = "1 @alice:x:10001:10000:Alice:/home/alice:/bin/bash";
 
 private Q_SLOTS:
     void initTestCase()
     {
-        m_nss = dlopen(WrappedCommand::modulePath("libnss_kest.so.2").constData(), RTLD_NOW | RTLD_LOCAL);
-        QVERIFY2(m_nss, dlerror());
+        QVERIFY2(m_nss.isLoaded(), m_nss.errorText().constData());
         QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
         QVERIFY(m_root.writeSettings(settings(2)));
         QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
@@ -177,15 +151,15 @@ private Q_SLOTS:
     // negative time, and again after it. Within it the map answers, even while the daemon is frozen.
     void daemonRunning()
     {
-        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+        QCOMPARE(call("getpwnam", "@alice"), alice);
         QTRY_VERIFY(QFileInfo::exists(mapPath()));
         struct stat map;
         QCOMPARE(stat(QFile::encodeName(mapPath()).constData(), &map), 0);
         QCOMPARE(QList<uint>({ map.st_uid, map.st_mode & 07777 }), QList<uint>({ 0, 0644 }));
         QVERIFY(!m_root.readFile(QStringLiteral("/run/cache-kest.map")).contains("alice-password"));
         QVERIFY(m_server.clearRequests());
-        QCOMPARE(call("getpwuid", "10001"), QByteArray("1 @alice:10001:Alice"));
-        QCOMPARE(call("initgroups", "@alice"), QByteArray("1 27 7"));
+        QCOMPARE(call("getpwuid", "10001"), alice);
+        QCOMPARE(call("initgroups", "@alice"), QByteArray("1 10000 27 7"));
         QCOMPARE(serverRequests(), 0);
         for (const QByteArray &unknown : { QByteArray("getpwnam @carol"), QByteArray("getpwuid 10099") }) {
             const QByteArray function = unknown.split(' ').at(0), key = unknown.split(' ').at(1);
@@ -209,7 +183,7 @@ private Q_SLOTS:
     // loses it well within the stated bound.
     void removedByFrontService()
     {
-        QCOMPARE(call("getpwnam", "@bob"), QByteArray("1 @bob:10002:Bob"));
+        QCOMPARE(call("getpwnam", "@bob"), QByteArray("1 @bob:x:10002:10000:Bob:/home/bob:/bin/bash"));
         QJsonObject data = DomainServerFixture::defaultData();
         QJsonArray users = data.value(QLatin1String("users")).toArray();
         users.removeLast();
@@ -230,7 +204,7 @@ private Q_SLOTS:
         QCOMPARE(call("getpwnam", "@alice"), QByteArray("0"));
         QVERIFY(m_root.writeSettings(settings(2)));
         QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(mapPath()), 2000);
-        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+        QCOMPARE(call("getpwnam", "@alice"), alice);
     }
 
     // With cache-kest stopped the last map answers; accounts it lacks are unavailable, its negative answers
