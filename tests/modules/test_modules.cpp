@@ -1,9 +1,8 @@
 #include "blackhole.h"
-#include "cachedaemonfixture.h"
+#include "cachesetup.h"
 #include "domainserverfixture.h"
 #include "loopbackpeer.h"
 #include "nssmodule.h"
-#include "testroot.h"
 #include "wrappedcommand.h"
 
 #include <QJsonDocument>
@@ -16,9 +15,7 @@ class ModulesTest : public QObject
 {
     Q_OBJECT
     NssModule m_nss;
-    TestRoot m_root;
-    DomainServerFixture m_server;
-    CacheDaemonFixture m_daemon;
+    CacheSetup m_s;
     QScopedPointer<Blackhole> m_blackhole;
 
 private Q_SLOTS:
@@ -26,15 +23,12 @@ private Q_SLOTS:
     {
         QVERIFY2(m_nss.isLoaded(), m_nss.errorText().constData());
         const QByteArray service = " required " + WrappedCommand::modulePath("pam_kest.so") + '\n';
-        QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
-        QVERIFY(m_root.writeSettings(m_server.settingsIni({ { QStringLiteral("main/enable"), true } })
-            + "[offline_login]\nenable=true\ncache_validity=1\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/kest"),
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/kest"),
             "auth" + service + "account" + service + "password" + service + "session" + service));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/other"), ""));
-        QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/other"), ""));
+        QVERIFY2(m_s.start(), qPrintable(m_s.errorText()));
     }
 
     void nssContract_data()
@@ -79,7 +73,7 @@ private Q_SLOTS:
         // The pid names a running cache-kest, the port the stand-in.
         if (!answers.isEmpty())
             QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"),
-                QByteArray::number(m_daemon.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
+                QByteArray::number(m_s.daemon.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
         const QByteArrayList parts = call.split(' ');
         const QByteArray result = m_nss.call(parts.at(0), parts.at(1), parts.value(2, "1024").toUInt());
         QByteArrayList asked;
@@ -170,15 +164,15 @@ private Q_SLOTS:
         QFETCH(int, stage);
         QFETCH(QByteArray, command);
         if (stage == 1 && !m_blackhole) {
-            m_server.stop();
-            m_daemon.stop();
-            m_blackhole.reset(new Blackhole(DomainServerFixture::address(), m_server.port()));
+            m_s.server.stop();
+            m_s.daemon.stop();
+            m_blackhole.reset(new Blackhole(DomainServerFixture::address(), m_s.server.port()));
             QVERIFY(m_blackhole->isFull());
-            QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+            QVERIFY2(m_s.daemon.start(), qPrintable(m_s.daemon.errorText()));
         }
         if (stage == 2)
-            m_daemon.stop();
-        QTEST(WrappedCommand::run(QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped"))), command), "result");
+            m_s.daemon.stop();
+        QTEST(WrappedCommand::run(QFile::encodeName(m_s.root.filePath(QStringLiteral("/wrapped"))), command), "result");
     }
 };
 
