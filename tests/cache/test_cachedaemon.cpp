@@ -279,8 +279,8 @@ private Q_SLOTS:
     }
 
     // A server that hands out a uid of the machine's own range is not believed: nothing is cached. What is
-    // cached outlives the server: kept while it is away, refreshed once it is back, and kept when the start-up
-    // refresh meets an impostor's certificate, whose server counts as unreachable.
+    // cached outlives the server: kept while it is away, refreshed once it is back. A server with an impostor's
+    // certificate is an unreachable one (the client's test), so its refresh keeps the records just the same.
     void cacheOutlivesTheServer()
     {
         s.reset(new Setup);
@@ -305,14 +305,7 @@ private Q_SLOTS:
         QVERIFY(s->hasRecord(10099));
         QVERIFY(s->server.start(s->server.port()));
         QTRY_VERIFY_WITH_TIMEOUT(!s->hasRecord(10099), 15000);
-
-        s->daemon.stop();
-        QVERIFY(s->server.start(s->server.port(), false, QStringLiteral("expired")));
-        QVERIFY2(s->daemon.start(), qPrintable(s->daemon.errorText()));
-        QCOMPARE((Replies { s->lookUp("@bob"), s->lookUp("@alice"), s->login("@alice", "alice-password") }),
-            (Replies { passFalse, passTrue, passTrue }));
-        QTest::qWait(1500); // the start-up refresh has run
-        QCOMPARE(QDir(s->root.workDir()).entryList({ QStringLiteral("1*") }), QStringList { QStringLiteral("10001") });
+        QVERIFY(s->hasRecord(10001));
     }
 
     // Root's commands change the cache and the policy; any other local user may only look up. Then the
