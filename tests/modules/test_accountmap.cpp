@@ -1,7 +1,7 @@
 #include "accountmap.h"
-#include "cachedaemonfixture.h"
+#include "cachesetup.h"
 #include "domainserverfixture.h"
-#include "testroot.h"
+#include "nssmodule.h"
 #include "wrappedcommand.h"
 
 extern "C" {
@@ -14,10 +14,6 @@ extern "C" {
 #include <QJsonArray>
 #include <QTest>
 
-#include <dlfcn.h>
-#include <grp.h>
-#include <nss.h>
-#include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -27,52 +23,27 @@ extern "C" {
 class AccountMapTest : public QObject
 {
     Q_OBJECT
-    void *m_nss = nullptr;
-    TestRoot m_root;
-    DomainServerFixture m_server;
-    CacheDaemonFixture m_daemon;
+    NssModule m_nss;
+    CacheSetup m_s;
 
-    QString mapPath() const { return m_root.filePath(QStringLiteral("/run/cache-kest.map")); }
-    QByteArray settings(int negativeSeconds, bool enabled = true) const
+    QString mapPath() const { return m_s.root.filePath(QStringLiteral("/run/cache-kest.map")); }
+    bool writeSettings(bool enabled = true) const
     {
-        return m_server.settingsIni({ { QStringLiteral("main/enable"), enabled },
-            { QStringLiteral("main/negative-cache-timeout"), negativeSeconds } });
+        return m_s.writeSettings(
+            { { QStringLiteral("main/enable"), enabled }, { QStringLiteral("main/negative-cache-timeout"), 2 } });
     }
 
-    template<typename... Arguments> nss_status (*entry_point(const char *name) const)(Arguments...)
-    {
-        return reinterpret_cast<nss_status (*)(Arguments...)>(dlsym(m_nss, name));
-    }
-    // "status entry" of one call of the loaded module: the entry as a passwd line or a gid list.
+    // "status entry" of one call of the loaded module (see NssModule::call).
     QByteArray call(const QByteArray &function, const QByteArray &key) const
     {
-        char buffer[1024];
-        int error = 0, status;
-        passwd pwd {};
-        QByteArray entry;
-        if (function == "getpwnam" || function == "getpwuid") {
-            const bool byName = function == "getpwnam";
-            status = byName ? entry_point<const char *, passwd *, char *, size_t, int *>("_nss_kest_getpwnam_r")(
-                         key.constData(), &pwd, buffer, sizeof(buffer), &error)
-                            : entry_point<uid_t, passwd *, char *, size_t, int *>("_nss_kest_getpwuid_r")(
-                                uid_t(key.toUInt()), &pwd, buffer, sizeof(buffer), &error);
-            if (status == NSS_STATUS_SUCCESS)
-                entry = QByteArrayList({ pwd.pw_name, QByteArray::number(pwd.pw_uid), pwd.pw_gecos }).join(':');
-        } else {
-            long start = 0, size = 0;
-            gid_t *groups = nullptr;
-            status = entry_point<const char *, gid_t, long *, long *, gid_t **, long, int *>(
-                "_nss_kest_initgroups_dyn")(key.constData(), gid_t(10000), &start, &size, &groups, 0L, &error);
-            for (long i = 0; i < start; ++i)
-                entry += QByteArray::number(groups[i]) + ' ';
-            free(groups);
-        }
-        return (QByteArray::number(status) + ' ' + entry).trimmed();
+        QByteArrayList parts = m_nss.call(function, key).split(' ');
+        parts.removeAt(1);
+        return parts.join(' ');
     }
     // Whether the published map answers key (a name or a uid) "no such account" now.
     bool mapSaysNo(const QByteArray &key) const
     {
-        const QByteArray bytes = m_root.readFile(QStringLiteral("/run/cache-kest.map"));
+        const QByteArray bytes = m_s.root.readFile(QStringLiteral("/run/cache-kest.map"));
         const qint64 now = QDateTime::currentSecsSinceEpoch();
         kest_map_view view;
         return kest_map_view_init(&view, bytes.constData(), size_t(bytes.size()))
@@ -80,20 +51,18 @@ class AccountMapTest : public QObject
                                     : kest_map_negative_uid(&view, key.toUInt(), now))
             == KEST_MAP_FOUND;
     }
-    int serverRequests() const { return m_server.requests().size(); }
+    int serverRequests() const { return m_s.server.requests().size(); }
+    const QByteArray alice = "1 @alice:x:10001:10000:Alice:/home/alice:/bin/bash";
 
 private Q_SLOTS:
     void initTestCase()
     {
-        m_nss = dlopen(WrappedCommand::modulePath("libnss_kest.so.2").constData(), RTLD_NOW | RTLD_LOCAL);
-        QVERIFY2(m_nss, dlerror());
-        QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
-        QVERIFY(m_root.writeSettings(settings(2)));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
-        QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+        QVERIFY2(m_nss.isLoaded(), m_nss.errorText().constData());
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
+        QVERIFY2(m_s.start({ { QStringLiteral("main/negative-cache-timeout"), 2 } }), qPrintable(m_s.errorText()));
         // The start-up refresh asks the server for every known account: done before any is counted.
-        QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(m_root.workDir() + QStringLiteral("/groups.txt")), 5000);
+        QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(m_s.root.workDir() + QStringLiteral("/groups.txt")), 5000);
     }
 
     void layout_data()
@@ -177,26 +146,26 @@ private Q_SLOTS:
     // negative time, and again after it. Within it the map answers, even while the daemon is frozen.
     void daemonRunning()
     {
-        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+        QCOMPARE(call("getpwnam", "@alice"), alice);
         QTRY_VERIFY(QFileInfo::exists(mapPath()));
         struct stat map;
         QCOMPARE(stat(QFile::encodeName(mapPath()).constData(), &map), 0);
         QCOMPARE(QList<uint>({ map.st_uid, map.st_mode & 07777 }), QList<uint>({ 0, 0644 }));
-        QVERIFY(!m_root.readFile(QStringLiteral("/run/cache-kest.map")).contains("alice-password"));
-        QVERIFY(m_server.clearRequests());
-        QCOMPARE(call("getpwuid", "10001"), QByteArray("1 @alice:10001:Alice"));
-        QCOMPARE(call("initgroups", "@alice"), QByteArray("1 27 7"));
+        QVERIFY(!m_s.root.readFile(QStringLiteral("/run/cache-kest.map")).contains("alice-password"));
+        QVERIFY(m_s.server.clearRequests());
+        QCOMPARE(call("getpwuid", "10001"), alice);
+        QCOMPARE(call("initgroups", "@alice"), QByteArray("1 10000 27 7"));
         QCOMPARE(serverRequests(), 0);
         for (const QByteArray &unknown : { QByteArray("getpwnam @carol"), QByteArray("getpwuid 10099") }) {
             const QByteArray function = unknown.split(' ').at(0), key = unknown.split(' ').at(1);
-            QVERIFY(m_server.clearRequests());
+            QVERIFY(m_s.server.clearRequests());
             QCOMPARE(call(function, key), QByteArray("0"));
             const int asked = serverRequests();
             QVERIFY(asked > 0);
             QTRY_VERIFY(mapSaysNo(key));
-            QCOMPARE(kill(pid_t(m_daemon.processId()), SIGSTOP), 0);
+            QCOMPARE(kill(pid_t(m_s.daemon.processId()), SIGSTOP), 0);
             const QByteArray frozen = call(function, key);
-            QCOMPARE(kill(pid_t(m_daemon.processId()), SIGCONT), 0);
+            QCOMPARE(kill(pid_t(m_s.daemon.processId()), SIGCONT), 0);
             QCOMPARE(frozen, QByteArray("0"));
             QCOMPARE(serverRequests(), asked);
             QTest::qWait(2100);
@@ -209,28 +178,28 @@ private Q_SLOTS:
     // loses it well within the stated bound.
     void removedByFrontService()
     {
-        QCOMPARE(call("getpwnam", "@bob"), QByteArray("1 @bob:10002:Bob"));
+        QCOMPARE(call("getpwnam", "@bob"), QByteArray("1 @bob:x:10002:10000:Bob:/home/bob:/bin/bash"));
         QJsonObject data = DomainServerFixture::defaultData();
         QJsonArray users = data.value(QLatin1String("users")).toArray();
         users.removeLast();
         data.insert(QStringLiteral("users"), users);
-        QVERIFY(m_server.setData(data));
-        QVERIFY(QFile::remove(m_root.workDir() + QStringLiteral("/10002")));
+        QVERIFY(m_s.server.setData(data));
+        QVERIFY(QFile::remove(m_s.root.workDir() + QStringLiteral("/10002")));
         QElapsedTimer timer;
         timer.start();
         QTRY_COMPARE_WITH_TIMEOUT(call("getpwuid", "10002"), QByteArray("0"), 2000);
         QVERIFY2(timer.elapsed() < 1000, qPrintable(QString::number(timer.elapsed())));
-        QVERIFY(m_server.setData(DomainServerFixture::defaultData()));
+        QVERIFY(m_s.server.setData(DomainServerFixture::defaultData()));
     }
 
     void enableOffWithdrawsTheMap()
     {
-        QVERIFY(m_root.writeSettings(settings(2, false)));
+        QVERIFY(writeSettings(false));
         QTRY_VERIFY_WITH_TIMEOUT(!QFileInfo::exists(mapPath()), 2000);
         QCOMPARE(call("getpwnam", "@alice"), QByteArray("0"));
-        QVERIFY(m_root.writeSettings(settings(2)));
+        QVERIFY(writeSettings());
         QTRY_VERIFY_WITH_TIMEOUT(QFileInfo::exists(mapPath()), 2000);
-        QCOMPARE(call("getpwnam", "@alice"), QByteArray("1 @alice:10001:Alice"));
+        QCOMPARE(call("getpwnam", "@alice"), alice);
     }
 
     // With cache-kest stopped the last map answers; accounts it lacks are unavailable, its negative answers
@@ -260,16 +229,16 @@ private Q_SLOTS:
         QFETCH(QByteArray, change);
         QFETCH(QByteArray, command);
         static QByteArray published;
-        if (m_daemon.isRunning()) {
+        if (m_s.daemon.isRunning()) {
             QCOMPARE(call("getpwnam", "@nobody"), QByteArray("0"));
             QTRY_VERIFY(mapSaysNo("@nobody"));
             // Found running by the module just before it stops.
             QCOMPARE(call("getpwnam", "@nobody"), QByteArray("0"));
-            QCOMPARE(m_daemon.stop(), 0);
-            published = m_root.readFile(QStringLiteral("/run/cache-kest.map"));
+            QCOMPARE(m_s.daemon.stop(), 0);
+            published = m_s.root.readFile(QStringLiteral("/run/cache-kest.map"));
         }
         const QByteArray path = QFile::encodeName(mapPath());
-        QVERIFY(m_root.writeFile(
+        QVERIFY(m_s.root.writeFile(
             QStringLiteral("/run/cache-kest.map"), change == "cut" ? published.left(published.size() / 2) : published));
         QCOMPARE(chmod(path.constData(), change == "chmod" ? 0664 : 0644), 0);
         QCOMPARE(chown(path.constData(), change == "chown" ? 65534 : 0, 0), 0);
@@ -278,7 +247,7 @@ private Q_SLOTS:
             result = call(command.split(' ').at(0), command.split(' ').at(1));
             result = result.left(result.indexOf(' ') < 0 ? result.size() : result.indexOf(' '));
         } else {
-            result = WrappedCommand::run(QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped"))), command);
+            result = WrappedCommand::run(QFile::encodeName(m_s.root.filePath(QStringLiteral("/wrapped"))), command);
         }
         QTEST(result, "result");
     }

@@ -1,51 +1,34 @@
 #include "blackhole.h"
-#include "cachedaemonfixture.h"
+#include "cachesetup.h"
 #include "domainserverfixture.h"
 #include "loopbackpeer.h"
-#include "testroot.h"
+#include "nssmodule.h"
 #include "wrappedcommand.h"
 
 #include <QJsonDocument>
 #include <QProcess>
 #include <QTest>
 
-#include <dlfcn.h>
-#include <grp.h>
-#include <nss.h>
-#include <pwd.h>
-
 // The modules as glibc and PAM load them: their contract with glibc against a stand-in daemon, then
 // the real getent, id and pamtester against the real cache-kest and the test domain server.
 class ModulesTest : public QObject
 {
     Q_OBJECT
-    void *m_nss = nullptr;
-    TestRoot m_root;
-    DomainServerFixture m_server;
-    CacheDaemonFixture m_daemon;
+    NssModule m_nss;
+    CacheSetup m_s;
     QScopedPointer<Blackhole> m_blackhole;
-
-    // An entry point of the loaded name-service module, called the way glibc calls it.
-    template<typename... Arguments> nss_status nss(const char *function, Arguments... arguments) const
-    {
-        return reinterpret_cast<nss_status (*)(Arguments...)>(dlsym(m_nss, function))(arguments...);
-    }
 
 private Q_SLOTS:
     void initTestCase()
     {
-        m_nss = dlopen(WrappedCommand::modulePath("libnss_kest.so.2").constData(), RTLD_NOW | RTLD_LOCAL);
-        QVERIFY2(m_nss, dlerror());
+        QVERIFY2(m_nss.isLoaded(), m_nss.errorText().constData());
         const QByteArray service = " required " + WrappedCommand::modulePath("pam_kest.so") + '\n';
-        QVERIFY2(m_server.isValid() && m_server.start(), qPrintable(m_server.errorText()));
-        QVERIFY(m_root.writeSettings(m_server.settingsIni({ { QStringLiteral("main/enable"), true } })
-            + "[offline_login]\nenable=true\ncache_validity=1\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/kest"),
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/passwd"), "root:x:0:0:root:/root:/bin/bash\n"));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/group"), "root:x:0:\nsudo:x:27:\nlp:x:7:\n"));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/kest"),
             "auth" + service + "account" + service + "password" + service + "session" + service));
-        QVERIFY(m_root.writeFile(QStringLiteral("/wrapped/other"), ""));
-        QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+        QVERIFY(m_s.root.writeFile(QStringLiteral("/wrapped/other"), ""));
+        QVERIFY2(m_s.start(), qPrintable(m_s.errorText()));
     }
 
     void nssContract_data()
@@ -90,40 +73,9 @@ private Q_SLOTS:
         // The pid names a running cache-kest, the port the stand-in.
         if (!answers.isEmpty())
             QVERIFY(root.writeFile(QStringLiteral("/run/cache-kest.pid"),
-                QByteArray::number(m_daemon.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
-        // "status errno entry" of one call, the entry as a passwd or group line or a gid list.
+                QByteArray::number(m_s.daemon.processId()) + '\n' + QByteArray::number(standIn.port()) + '\n'));
         const QByteArrayList parts = call.split(' ');
-        const QByteArray function = parts.at(0), key = parts.at(1);
-        const size_t size = parts.value(2, "1024").toUInt();
-        QByteArray buffer(int(size), '\0'), entry;
-        int error = 0, status;
-        passwd pwd {};
-        group grp {};
-        long start = 1, room = 1;
-        auto *groups = static_cast<gid_t *>(malloc(sizeof(gid_t)));
-        groups[0] = 10000;
-        if (function == "getpwnam")
-            status = nss("_nss_kest_getpwnam_r", key.constData(), &pwd, buffer.data(), size, &error);
-        else if (function == "getpwuid")
-            status = nss("_nss_kest_getpwuid_r", uid_t(key.toUInt()), &pwd, buffer.data(), size, &error);
-        else if (function == "getgrnam")
-            status = nss("_nss_kest_getgrnam_r", key.constData(), &grp, buffer.data(), size, &error);
-        else
-            status = nss("_nss_kest_initgroups_dyn", key.constData(), gid_t(10000), &start, &room, &groups, 0L, &error);
-        if (status == NSS_STATUS_SUCCESS && pwd.pw_name)
-            entry = QByteArrayList({ pwd.pw_name, pwd.pw_passwd, QByteArray::number(pwd.pw_uid),
-                                       QByteArray::number(pwd.pw_gid), pwd.pw_gecos, pwd.pw_dir, pwd.pw_shell })
-                        .join(':');
-        if (status == NSS_STATUS_SUCCESS && grp.gr_name) {
-            entry = QString::asprintf("%s:%s:%u:", grp.gr_name, grp.gr_passwd, grp.gr_gid).toUtf8();
-            for (char **member = grp.gr_mem; *member; ++member)
-                entry += QByteArray(*member) + (member[1] ? "," : "");
-        }
-        for (long i = 0; function == "initgroups" && i < start; ++i)
-            entry += QByteArray::number(groups[i]) + ' ';
-        free(groups);
-        const QByteArray result
-            = (QByteArray::number(status) + ' ' + QByteArray::number(error) + ' ' + entry).trimmed();
+        const QByteArray result = m_nss.call(parts.at(0), parts.at(1), parts.value(2, "1024").toUInt());
         QByteArrayList asked;
         for (const QByteArray &request : standIn.finish())
             asked.append(QJsonDocument::fromJson(request.mid(4))[QLatin1String("functionName")].toString().toUtf8());
@@ -152,10 +104,7 @@ private Q_SLOTS:
         const auto lookUp = [&](quint16 port) {
             if (port != 0)
                 root.writeFile(QStringLiteral("/run/cache-kest.pid"), pid + '\n' + QByteArray::number(port) + '\n');
-            passwd pwd {};
-            char buffer[1024];
-            int error = 0;
-            return nss("_nss_kest_getpwnam_r", "@alice", &pwd, static_cast<char *>(buffer), sizeof(buffer), &error);
+            return nss_status(m_nss.call("getpwnam", "@alice").split(' ').at(0).toInt());
         };
         QCOMPARE(lookUp(first.port()), NSS_STATUS_SUCCESS);
         QCOMPARE(lookUp(second.port()), NSS_STATUS_SUCCESS);
@@ -215,15 +164,15 @@ private Q_SLOTS:
         QFETCH(int, stage);
         QFETCH(QByteArray, command);
         if (stage == 1 && !m_blackhole) {
-            m_server.stop();
-            m_daemon.stop();
-            m_blackhole.reset(new Blackhole(DomainServerFixture::address(), m_server.port()));
+            m_s.server.stop();
+            m_s.daemon.stop();
+            m_blackhole.reset(new Blackhole(DomainServerFixture::address(), m_s.server.port()));
             QVERIFY(m_blackhole->isFull());
-            QVERIFY2(m_daemon.start(), qPrintable(m_daemon.errorText()));
+            QVERIFY2(m_s.daemon.start(), qPrintable(m_s.daemon.errorText()));
         }
         if (stage == 2)
-            m_daemon.stop();
-        QTEST(WrappedCommand::run(QFile::encodeName(m_root.filePath(QStringLiteral("/wrapped"))), command), "result");
+            m_s.daemon.stop();
+        QTEST(WrappedCommand::run(QFile::encodeName(m_s.root.filePath(QStringLiteral("/wrapped"))), command), "result");
     }
 };
 

@@ -45,6 +45,29 @@ QByteArray CacheDaemonFixture::functionCall(const QString &name, const QStringLi
     return QJsonDocument(request).toJson(QJsonDocument::Compact);
 }
 
+QJsonObject CacheDaemonFixture::Run::json() const
+{
+    return QJsonDocument::fromJson(out).object();
+}
+
+CacheDaemonFixture::Run CacheDaemonFixture::run(const QStringList &arguments, uint uid)
+{
+    QProcess client;
+    if (uid == 0)
+        client.start(programPath(), arguments);
+    else
+        client.start(QStringLiteral("setpriv"),
+            QStringList { QStringLiteral("--reuid=%1").arg(uid), QStringLiteral("--regid=%1").arg(uid),
+                QStringLiteral("--clear-groups"), programPath() }
+                + arguments);
+    Run result;
+    if (client.waitForFinished(60000) && client.exitStatus() == QProcess::NormalExit)
+        result.status = client.exitCode();
+    result.out = client.readAllStandardOutput();
+    result.err = client.readAllStandardError();
+    return result;
+}
+
 bool CacheDaemonFixture::start()
 {
     QFile pidFile(QString::fromLocal8Bit(qgetenv("KEST_IAM_ROOT")) + QStringLiteral("/run/cache-kest.pid"));

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <QByteArray>
+#include <QJsonObject>
 #include <QProcess>
 #include <QString>
 #include <QStringList>
@@ -15,6 +16,15 @@ public:
     static QString programPath();
     static QByteArray frame(const QByteArray &payload);
     static QByteArray functionCall(const QString &name, const QStringList &argv);
+
+    struct Run {
+        int status = -1; // -1: did not end normally in time
+        QByteArray out;
+        QByteArray err;
+        QJsonObject json() const;
+    };
+    // The daemon's command line, as root or under another uid without groups.
+    static Run run(const QStringList &arguments, uint uid = 0);
 
     // Starts the daemon and waits until its pid file names the port it listens on.
     bool start();
