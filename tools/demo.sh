@@ -135,12 +135,7 @@ export DBUS_SYSTEM_BUS_ADDRESS=$(head -n 1 "$work/bus.address")
 echo "   DBUS_SYSTEM_BUS_ADDRESS=$DBUS_SYSTEM_BUS_ADDRESS"
 
 step "The test domain server on 127.0.0.2, with the network account alice"
-cat >"$work/domain.json" <<'JSON'
-{"users": [{"uid": 10001, "name": "alice", "password": "alice-password",
-            "primary_group": {"id": 10000, "name": "kest"}, "permissions": ["lp"],
-            "gecos": "Alice Liddell", "home": "/home/@alice", "shell": "/bin/bash"}],
- "groups": [{"gid": 10000, "name": "kest", "members": ["alice"]}]}
-JSON
+cp "$top/tools/test-domain-server/alice.json" "$work/domain.json"
 start_domain_server() {
     # Created here, so that the wait below never reads a file the server's shell has not opened yet.
     : >"$work/domain.out"

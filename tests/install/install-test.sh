@@ -155,12 +155,7 @@ check "root: chpasswd" succeeds 'root:Root-pass-3x\n' chpasswd
 check "root: log in with the password chpasswd set" succeeds 'Root-pass-3x\n' pamtester login root authenticate
 
 echo "== a network account"
-cat >"$root/opt/kest-test/domain.json" <<'JSON'
-{"users": [{"uid": 10001, "name": "alice", "password": "alice-password",
-            "primary_group": {"id": 10000, "name": "kest"}, "permissions": ["lp"],
-            "gecos": "Alice Liddell", "home": "/home/@alice", "shell": "/bin/bash"}],
- "groups": [{"gid": 10000, "name": "kest", "members": ["alice"]}]}
-JSON
+cp "$top/tools/test-domain-server/alice.json" "$root/opt/kest-test/domain.json"
 start_in_root "$work/domain.out" /opt/kest-test/kest-test-domain-server --address 127.0.0.2 --port 0 \
     --cert /opt/kest-test/certs/server.pem --key /opt/kest-test/certs/server.key --ca /opt/kest-test/certs/ca.pem \
     --data /opt/kest-test/domain.json
